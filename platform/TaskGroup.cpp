@@ -1,0 +1,70 @@
+// Portable: standard library only.
+#include "platform/TaskGroup.h"
+
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <mutex>
+
+namespace halvex {
+
+struct TaskGroup::State {
+  std::mutex mutex;
+  std::condition_variable drained;
+  long count = 0;
+};
+
+TaskGroup::TaskGroup() : state_(std::make_shared<State>()) {}
+
+void TaskGroup::enter() const {
+  std::lock_guard lock(state_->mutex);
+  ++state_->count;
+}
+
+void TaskGroup::leave() const {
+  std::unique_lock lock(state_->mutex);
+  if (state_->count == 0) {
+    lock.unlock();
+    std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
+    std::abort();
+  }
+  if (--state_->count == 0) {
+    state_->drained.notify_all();
+  }
+}
+
+void TaskGroup::wait() const {
+  std::unique_lock lock(state_->mutex);
+  state_->drained.wait(lock, [this] { return state_->count == 0; });
+}
+
+bool TaskGroup::waitFor(std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(state_->mutex);
+  return state_->drained.wait_for(lock, timeout, [this] { return state_->count == 0; });
+}
+
+TaskGroupHold::TaskGroupHold(TaskGroup group) : group_(std::make_unique<TaskGroup>(group)) {
+  group_->enter();
+}
+
+TaskGroupHold::TaskGroupHold(const TaskGroupHold& other) {
+  if (other.group_) {
+    group_ = std::make_unique<TaskGroup>(*other.group_);
+    group_->enter();
+  }
+}
+
+TaskGroupHold::TaskGroupHold(TaskGroupHold&& other) noexcept : group_(std::move(other.group_)) {}
+
+TaskGroupHold& TaskGroupHold::operator=(TaskGroupHold other) noexcept {
+  std::swap(group_, other.group_);
+  return *this;
+}
+
+TaskGroupHold::~TaskGroupHold() {
+  if (group_) {
+    group_->leave();
+  }
+}
+
+}  // namespace halvex

@@ -1,0 +1,15 @@
+# Debian packages the build, the tests and the demo need. Sourced by the other scripts.
+halvex_packages=(cmake make g++ pkgconf libgtest-dev libgmock-dev libbenchmark-dev
+  libsystemd-dev nlohmann-json3-dev dbus-daemon systemd tar gzip util-linux procps)
+
+ensure_packages() {
+  local missing=() p
+  for p in "${halvex_packages[@]}"; do
+    dpkg-query -W -f='${Status}' "${p}" 2>/dev/null | grep -q 'install ok installed' || missing+=("${p}")
+  done
+  ((${#missing[@]})) || return 0
+  echo "installing: ${missing[*]}"
+  export DEBIAN_FRONTEND=noninteractive
+  apt-get update
+  apt-get install -y --no-install-recommends "${missing[@]}" </dev/null
+}

@@ -2,6 +2,6 @@
 function(halvex_warnings target)
   target_compile_options(${target} PRIVATE
     -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align
-    -Woverloaded-virtual -Wconversion -Wsign-conversion -Wnull-dereference
+    -Woverloaded-virtual -Wconversion -Wsign-conversion
     -Wimplicit-fallthrough -Werror)
 endfunction()

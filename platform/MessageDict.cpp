@@ -26,7 +26,9 @@ std::string MessageDict::getString(std::string_view key, std::string_view fallba
   return value ? value->stringOr(fallback) : std::string(fallback);
 }
 
-bool operator==(const MessageDict& a, const MessageDict& b) { return a.entries_ == b.entries_; }
+bool operator==(const MessageDict& a, const MessageDict& b) {
+  return a.entries_ == b.entries_;
+}
 
 MessageValue MessageValue::string(std::string text) {
   MessageValue value;

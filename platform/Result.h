@@ -15,7 +15,9 @@ struct Result {
   bool ok() const { return code == 0; }
 };
 
-constexpr std::int32_t resultCode(std::uint32_t bits) { return static_cast<std::int32_t>(bits); }
+constexpr std::int32_t resultCode(std::uint32_t bits) {
+  return static_cast<std::int32_t>(bits);
+}
 
 // The server is not on the bus (or there is no bus at all).
 inline constexpr std::int32_t kResultServerNotRunning = resultCode(0xE020E001u);

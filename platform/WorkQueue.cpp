@@ -89,10 +89,16 @@ WorkQueue WorkQueue::create(std::string label) {
   return WorkQueue(std::make_shared<Impl>(std::move(label)));
 }
 
-const std::string& WorkQueue::label() const { return impl_->label(); }
+const std::string& WorkQueue::label() const {
+  return impl_->label();
+}
 
-void WorkQueue::post(Closure closure) const { impl_->post(std::move(closure)); }
+void WorkQueue::post(Closure closure) const {
+  impl_->post(std::move(closure));
+}
 
-bool WorkQueue::isCurrent() const { return impl_->isCurrent(); }
+bool WorkQueue::isCurrent() const {
+  return impl_->isCurrent();
+}
 
 }  // namespace halvex

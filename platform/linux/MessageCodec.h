@@ -1,9 +1,16 @@
 // Encoding of messages on the bus, shared by the host backend and the simulator.
 // See docs/dbus-protocol.md for the mapping. These functions touch only the message they are
 // given, so they run on whichever thread owns that message's bus.
+//
+// Encoding checks the whole value before it appends anything, so a value that cannot be sent
+// leaves the message as it was. Decoding stops at the first fault; the message's read position is
+// then unspecified and the caller should treat the whole message as bad. Decoded output is only
+// complete when the call returns 0.
 #pragma once
 
 #include <systemd/sd-bus.h>
+
+#include <cstddef>
 
 #include "platform/MessageDict.h"
 
@@ -12,15 +19,25 @@ namespace halvex::bus {
 // Deepest nesting of dictionaries accepted in either direction.
 inline constexpr int kMaxDictDepth = 16;
 
+// Largest number of entries in one dictionary, and of values (entries and nested values counted
+// together) in one encoded or decoded value. Both directions enforce them so that a peer cannot
+// make us spend unbounded time or memory on one message; MessageDict's set is linear in its size.
+inline constexpr std::size_t kMaxDictEntries = 1024;
+inline constexpr std::size_t kMaxValues = 16384;
+
 // Appends dict as "a{sv}". Returns 0, or a negative errno (-EINVAL for a string that is not
-// valid UTF-8 or nesting deeper than kMaxDictDepth).
+// valid UTF-8 or holds a NUL byte, or nesting deeper than kMaxDictDepth; -E2BIG beyond the size
+// limits above).
 int appendDict(sd_bus_message* message, const MessageDict& dict);
 
-// Appends value as a variant "v"; null is a variant holding the empty signature.
+// Appends value as a variant "v"; null is a variant holding the empty signature. Errors as for
+// appendDict.
 int appendVariant(sd_bus_message* message, const MessageValue& value);
 
 // Reads an "a{sv}" at the current position. Returns 0, or a negative errno when the message
-// holds anything else there (-EBADMSG for a type outside the mapping).
+// holds anything else there (-EBADMSG for a type outside the mapping, a non-empty signature in a
+// null variant or nesting deeper than kMaxDictDepth; -E2BIG beyond the size limits). A key that
+// occurs twice keeps its first position and its last value, as MessageDict::set does.
 int readDict(sd_bus_message* message, MessageDict& dict);
 
 // Reads a "v" at the current position.

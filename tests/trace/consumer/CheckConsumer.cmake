@@ -1,0 +1,40 @@
+# cmake -P script: installs the HalvexTrace component of BUILD_DIR into a scratch prefix under
+# WORK_DIR, builds the consumer project in CONSUMER_DIR against it and runs the result.
+# Also takes CONFIG, GENERATOR, CXX_COMPILER and LINK_FLAGS from the calling build.
+foreach(required BUILD_DIR CONSUMER_DIR WORK_DIR GENERATOR CXX_COMPILER)
+  if(NOT DEFINED ${required})
+    message(FATAL_ERROR "CheckConsumer.cmake needs -D${required}=...")
+  endif()
+endforeach()
+
+function(run)
+  execute_process(COMMAND ${ARGN} RESULT_VARIABLE status)
+  if(NOT status EQUAL 0)
+    list(JOIN ARGN " " command)
+    message(FATAL_ERROR "failed (${status}): ${command}")
+  endif()
+endfunction()
+
+set(prefix ${WORK_DIR}/prefix)
+set(build ${WORK_DIR}/build)
+file(REMOVE_RECURSE ${WORK_DIR})
+
+set(config_args)
+if(CONFIG)
+  set(config_args --config ${CONFIG})
+endif()
+run(${CMAKE_COMMAND} --install ${BUILD_DIR} ${config_args} --component HalvexTrace
+    --prefix ${prefix})
+# Only the scratch prefix may satisfy find_package, never the build tree or a registry.
+run(${CMAKE_COMMAND} -S ${CONSUMER_DIR} -B ${build} -G ${GENERATOR}
+    -DCMAKE_CXX_COMPILER=${CXX_COMPILER}
+    -DCMAKE_BUILD_TYPE=${CONFIG}
+    -DCMAKE_PREFIX_PATH=${prefix}
+    -DCMAKE_FIND_USE_PACKAGE_REGISTRY=OFF
+    -DCMAKE_FIND_USE_SYSTEM_PACKAGE_REGISTRY=OFF
+    "-DCMAKE_EXE_LINKER_FLAGS=${LINK_FLAGS}")
+run(${CMAKE_COMMAND} --build ${build} ${config_args})
+
+find_program(consumer trace_consumer PATHS ${build} ${build}/${CONFIG} NO_DEFAULT_PATH
+             NO_CACHE REQUIRED)
+run(${consumer})

@@ -1,0 +1,189 @@
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "TestTree.h"
+#include "platform/WorkQueue.h"
+#include "shell/CommandShell.h"
+
+namespace halvex::testing {
+namespace {
+
+using namespace std::string_literals;
+
+const std::string P = prompt("/halvextool");
+const std::string PL = prompt("/halvextool/logdump");
+const std::string R = kRootHelp;
+const std::string L = kLogdumpHelp;
+
+// "r" has an option and a sub-command both named "dup" (alias "d"), and options named like the
+// built-ins "help" and "cd".
+std::shared_ptr<TestCommand> makeShadowTree() {
+  return TestCommand::create("r", {}, [](TestCommand& r) {
+    r.addEcho("dup");
+    r.addEcho("help");
+    r.addEcho("cd");
+    const auto dup = r.addChild("dup", [](TestCommand& d) { d.addEcho("x"); });
+    r.addSubCommand(std::vector<std::string>{"dup", "d"}, dup);
+  });
+}
+
+struct ShellCase {
+  std::vector<std::string> args;  // program name first; just the name means interactive
+  std::string input;
+  bool ok;
+  std::string out;
+  std::string err = "";
+  std::string veto = "";  // a word that both the root and "logdump" refuse
+  std::shared_ptr<TestCommand> (*tree)() = makeToolTree;
+};
+
+TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
+  const ShellCase cases[] = {
+      // One-shot mode: the first failing command ends the run.
+      {{"t", "logdump", "tel", "a", "help", "cd", "--", "logdump", "bb"},
+       "",
+       true,
+       "tel(a,help,cd)\nbb()\n"},
+      {{"t", "logdump"}, "", false, L},
+      {{"t", "bogus"}, "", false, invalid("bogus") + R},
+      {{"t", "cd"}, "", false, R},
+      {{"t", "cd", "logdump", "x"}, "", false, R},
+      {{"t", "cd", "logdump/nope"}, "", false, L},
+      {{"t", "cd", "/"}, "", true, ""},
+      {{"t", "logdump", "cd", ".."}, "", true, ""},
+      {{"t", "cd", "logdump", "--", "tel"}, "", false, invalid("tel") + R},
+      {{"t", "--"}, "", true, ""},
+      {{"t", "--", "--", "logdump", "tel", "--", "--"}, "", true, "tel()\n"},
+      {{"t", "logdump", "tel", "--", "x"}, "", false, "tel()\n" + invalid("x") + R},
+      {{"t", "logdump", "tel", "fail", "--", "logdump", "bb"}, "", false, "tel(fail)\n"},
+      {{"t", "help"}, "", true, R},
+      {{"t", "logdump", "help"}, "", true, L},
+      {{"t", "help", "me"}, "", false, invalid("help") + R},
+      {{"t", "quit", "now"}, "", false, invalid("quit") + R},
+      {{"t", "logdump", "back"}, "", false, invalid("back") + L},
+      {{"t", "back"}, "", true, ""},
+      {{"t", "logdump", "tel", "--", "exit", "--", "logdump", "bb"}, "", true, "tel()\n"},
+      {{"t", "logdump tel"}, "", false, invalid("logdump tel") + R},
+      {{"t", "logdump", "TEL"}, "", false, invalid("TEL") + L},
+      {{"t", "logdump", "core"}, "", false, "", "refused core\n", "core"},
+      {{"t", "logdump", "tel"}, "", false, "", "refused logdump\n", "logdump"},
+      {{"t", "dup", "x"}, "", true, "dup(x)\n", "", "", makeShadowTree},
+      {{"t", "help"}, "", true, "help()\n", "", "", makeShadowTree},
+      {{"t", "d", "x"}, "", true, "x()\n", "", "", makeShadowTree},
+      // Interactive mode: failures never end the run; end of input does, with false.
+      {{"t"}, "", false, P},
+      {{}, "quit\nlogdump tel\n", true, P},
+      {{"t"}, "\n \t\r\nexit", true, P + P + P},
+      {{"t"},
+       "cd logdump\ntel x\ncd ..\ncd logdump/\nback\ncd ../logdump\ncd ..\nback\n",
+       false,
+       P + PL + "tel(x)\n" + PL + P + PL + P + PL + P + P},
+      {{"t"}, "cd logdump -- tel\n", false, P + "tel()\n" + PL},
+      {{"t"},
+       "logdump tel -- logdump bb\nbogus\nlogdump tel -- logdump bb\n",
+       false,
+       P + "tel()\nbb()\n" + P + invalid("bogus") + R + P + "tel()\n" + P},
+      {{"t"}, "logdump\nhelp\n", false, P + L + P + R + P},
+      {{"t"}, "logdump tel -- logdump", false, P + "tel()\n" + L + P},
+      {{"t"},
+       "logdump tel\ncd logdump\ntel\n",
+       false,
+       P + P + PL + "tel()\n" + PL,
+       "refused logdump\n",
+       "logdump"},
+      {{"t"}, "cd d\n", false, prompt("/r") + prompt("/r/dup"), "", "", makeShadowTree},
+      // Bytes that are not whitespace belong to words; CR separates like any whitespace.
+      {{"t"},
+       "logdump\rtel\r\nlogdump bb -- logdump core\r\nte\0l\n\xff\n"s,
+       false,
+       P + "tel()\n" + P + "bb()\ncore()\n" + P + invalid("te\0l"s) + R + P + invalid("\xff") + R +
+           P},
+  };
+  for (const ShellCase& c : cases) {
+    std::string trace;
+    for (const std::string& arg : c.args) {
+      trace += "[" + arg + "]";
+    }
+    SCOPED_TRACE(trace + " input: " + c.input);
+    const auto root = c.tree();
+    root->vetoed.insert(c.veto);
+    if (const auto logdump =
+            std::dynamic_pointer_cast<TestCommand>(root->getSubCommand("logdump"))) {
+      logdump->vetoed.insert(c.veto);
+    }
+    const ShellRun run = runShell(root, c.args, c.input);
+    EXPECT_EQ(run.ok, c.ok);
+    EXPECT_EQ(run.out, c.out);
+    EXPECT_EQ(run.err, c.err);
+  }
+}
+
+TEST(CommandShellTest, MissingRootEndsTheRunSilently) {
+  for (const std::vector<std::string>& args : {std::vector<std::string>{"t"}, {"t", "help"}}) {
+    const ShellRun run = runShell(nullptr, args, "help\nquit\n");
+    EXPECT_FALSE(run.ok);
+    EXPECT_EQ(run.out, "");
+  }
+}
+
+TEST(CommandShellTest, HugeLinesAreSplitAndPassedWhole) {
+  const std::string huge(10 << 20, 'w');
+  std::string many;
+  for (int i = 0; i < (1 << 20); ++i) {
+    many += "arg" + std::to_string(i % 10) + "\t";
+  }
+  std::vector<std::pair<std::size_t, std::string>> received;  // argument count, last argument
+  const auto root = TestCommand::create("big", {}, [&received](TestCommand& big) {
+    big.addOption(
+        "take",
+        [&received](TaskGroup, std::vector<std::string> args) {
+          received.emplace_back(args.size(), args.back());
+          return true;
+        },
+        "");
+  });
+
+  const ShellRun run = runShell(root, {"t"}, huge + "\ntake " + many + "\ntake " + huge);
+  EXPECT_FALSE(run.ok);
+  const std::string bigHelp =
+      "\nOptions for command '\x1b[32mbig\x1b[39m':\n\n"
+      "\t            take  -  ...\n\n" +
+      kBuiltinsHelp;
+  EXPECT_EQ(run.out, prompt("/big") + invalid(huge) + bigHelp + prompt("/big") + prompt("/big") +
+                         prompt("/big"));
+  EXPECT_EQ(received,
+            (std::vector<std::pair<std::size_t, std::string>>{{1U << 20, "arg5"}, {1U, huge}}));
+}
+
+// Completions print from the queue; the shell waits for them before it prompts again.
+TEST(CommandShellTest, OutputOfAsynchronousWorkPrecedesTheNextPrompt) {
+  const WorkQueue queue = WorkQueue::create("shell.test");
+  const auto root = TestCommand::create("q", {}, [&queue](TestCommand& q) {
+    q.addOption(
+        "later",
+        [&queue](TaskGroup group, std::vector<std::string> args) {
+          queue.post([hold = TaskGroupHold(group), args] {
+            writeLine(consoleOut(), "done " + args.at(0));
+          });
+          return true;
+        },
+        "");
+  });
+  const ShellRun run = runShell(root, {"t"}, "later 1 -- later 2\nlater 3\n");
+  EXPECT_EQ(run.out, prompt("/q") + "done 1\ndone 2\n" + prompt("/q") + "done 3\n" + prompt("/q"));
+}
+
+TEST(CommandShellTest, SplittingRules) {
+  EXPECT_EQ(CommandShell::splitWords(" \t\n\v\f\ra\"b\\  'c'\0\xff \r"s),
+            (std::vector<std::string>{"a\"b\\", "'c'\0\xff"s}));
+  EXPECT_EQ(CommandShell::splitWords(" \t\r\n"), std::vector<std::string>{});
+  EXPECT_EQ(CommandShell::splitCommands({"--", "a", "--", "--", "b", "c", "--"}),
+            (std::vector<std::vector<std::string>>{{"a"}, {"b", "c"}}));
+  EXPECT_EQ(CommandShell::splitPath("//a//b/", '/'), (std::vector<std::string>{"a", "b"}));
+  EXPECT_EQ(CommandShell::splitPath("/", '/'), std::vector<std::string>{});
+}
+
+}  // namespace
+}  // namespace halvex::testing

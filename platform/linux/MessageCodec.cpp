@@ -6,6 +6,8 @@
 #include <string>
 #include <string_view>
 
+#include "platform/linux/detail/BusString.h"
+
 namespace halvex::bus {
 
 namespace {
@@ -13,59 +15,6 @@ namespace {
 constexpr char kDictSignature[] = "a{sv}";
 constexpr char kEntrySignature[] = "sv";
 constexpr char kEntryContainer[] = "{sv}";
-
-// D-Bus strings are NUL-terminated UTF-8 with no NUL inside. sd-bus checks UTF-8 itself, but
-// only when the string is appended, which leaves a half-built message behind, and it cannot see
-// an embedded NUL at all: the C string would just end early and change the value silently.
-bool isBusString(std::string_view text) {
-  const auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
-  std::size_t size = text.size();
-  std::size_t i = 0;
-  while (i < size) {
-    unsigned char lead = bytes[i];
-    if (lead == 0) {
-      return false;
-    }
-    if (lead < 0x80) {
-      ++i;
-      continue;
-    }
-    std::size_t length = 0;
-    std::uint32_t point = 0;
-    std::uint32_t lowest = 0;
-    if ((lead & 0xE0) == 0xC0) {
-      length = 2;
-      point = lead & 0x1Fu;
-      lowest = 0x80;
-    } else if ((lead & 0xF0) == 0xE0) {
-      length = 3;
-      point = lead & 0x0Fu;
-      lowest = 0x800;
-    } else if ((lead & 0xF8) == 0xF0) {
-      length = 4;
-      point = lead & 0x07u;
-      lowest = 0x10000;
-    } else {
-      return false;
-    }
-    if (size - i < length) {
-      return false;
-    }
-    for (std::size_t k = 1; k < length; ++k) {
-      unsigned char next = bytes[i + k];
-      if ((next & 0xC0) != 0x80) {
-        return false;
-      }
-      point = (point << 6) | (next & 0x3Fu);
-    }
-    // Overlong forms, UTF-16 surrogates and points beyond Unicode are not UTF-8.
-    if (point < lowest || (point >= 0xD800 && point <= 0xDFFF) || point > 0x10FFFF) {
-      return false;
-    }
-    i += length;
-  }
-  return true;
-}
 
 // Counts values against kMaxValues across one whole encode or decode.
 struct Budget {
@@ -307,6 +256,58 @@ int takeVariant(sd_bus_message* message, MessageValue& value, int depth, Budget&
 }
 
 }  // namespace
+
+// sd-bus checks UTF-8 itself, but only when the string is appended, which leaves a half-built
+// message behind; checking first keeps a rejected value from touching the message at all.
+bool isBusString(std::string_view text) {
+  const auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
+  std::size_t size = text.size();
+  std::size_t i = 0;
+  while (i < size) {
+    unsigned char lead = bytes[i];
+    if (lead == 0) {
+      return false;
+    }
+    if (lead < 0x80) {
+      ++i;
+      continue;
+    }
+    std::size_t length = 0;
+    std::uint32_t point = 0;
+    std::uint32_t lowest = 0;
+    if ((lead & 0xE0) == 0xC0) {
+      length = 2;
+      point = lead & 0x1Fu;
+      lowest = 0x80;
+    } else if ((lead & 0xF0) == 0xE0) {
+      length = 3;
+      point = lead & 0x0Fu;
+      lowest = 0x800;
+    } else if ((lead & 0xF8) == 0xF0) {
+      length = 4;
+      point = lead & 0x07u;
+      lowest = 0x10000;
+    } else {
+      return false;
+    }
+    if (size - i < length) {
+      return false;
+    }
+    for (std::size_t k = 1; k < length; ++k) {
+      unsigned char next = bytes[i + k];
+      if ((next & 0xC0) != 0x80) {
+        return false;
+      }
+      point = (point << 6) | (next & 0x3Fu);
+    }
+    // Overlong forms, UTF-16 surrogates and points beyond Unicode are not UTF-8.
+    if (point < lowest || (point >= 0xD800 && point <= 0xDFFF) || point > 0x10FFFF) {
+      return false;
+    }
+    i += length;
+  }
+  return true;
+}
 
 int appendDict(sd_bus_message* message, const MessageDict& dict) {
   if (message == nullptr) {

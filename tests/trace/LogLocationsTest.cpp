@@ -46,19 +46,5 @@ TEST(LogLocations, ComposedNamesReadAsOnTheDevice) {
             "/var/wireless/Library/Logs/Halvex/DIAG.scratch");
 }
 
-TEST(LogLocations, FoldersAreAbsoluteAndNested) {
-  for (const std::string folder :
-       {kScratchFolder, kTrashFolder, kSnapshotFolder, kWorkspaceFolder, kUncompressedFolder,
-        kPendingCompressionFolder, kMobileFaultkeepFolder, kVarniskFolder}) {
-    EXPECT_EQ(folder.front(), '/') << folder;
-    EXPECT_EQ(folder.back(), '/') << folder;
-  }
-  EXPECT_EQ(std::string(kUncompressedFolder).rfind(kWorkspaceFolder, 0), 0u);
-  EXPECT_EQ(std::string(kPendingCompressionFolder).rfind(kWorkspaceFolder, 0), 0u);
-  EXPECT_EQ(std::string(kVarniskFolder).rfind(kMobileFaultkeepFolder, 0), 0u);
-  EXPECT_EQ(std::string(kLogDirPrefix).rfind(kLogPrefixCommon, 0), 0u);
-  EXPECT_EQ(std::string(kLogTVCrashPrefix).rfind(kLogPrefixCommon, 0), 0u);
-}
-
 }  // namespace
 }  // namespace halvex::trace::tests

@@ -1,8 +1,5 @@
 #include "halvex/trace/DeviceIdentity.h"
 
-#include <map>
-
-#include "platform/DevicePropertyService.h"
 #include "platform/DeviceQueries.h"
 
 namespace halvex::trace {
@@ -16,18 +13,6 @@ const char* const kLogSubsystem = "org.halvex.trace";
 const char* const kRadioModels[] = {
     "RA10", "RA12", "RB20", "RB21", "RB22", "RC30", "RC31", "RA14", "RD40", "RD4.1",
 };
-
-// Created by the first caller that needs it and shared until exit; callers hold a counted
-// reference while they use it.
-std::shared_ptr<DevicePropertyService> propertyService() {
-  static const std::shared_ptr<DevicePropertyService> service = DevicePropertyService::create();
-  return service;
-}
-
-const std::map<std::string, std::string>& propertyMap() {
-  static const std::map<std::string, std::string> properties = propertyService()->getPropertyMap();
-  return properties;
-}
 
 }  // namespace
 
@@ -73,12 +58,6 @@ bool isCarrierOnlyBuild() {
 
 bool isInternalOrCarrierBuild() {
   return device::isInternalBuild() || device::isCarrierBuild();
-}
-
-std::string getBootArgs() {
-  const auto& properties = propertyMap();
-  const auto found = properties.find("boot-args");
-  return found != properties.end() ? found->second : std::string();
 }
 
 const LogContext& getGlobalLogContext() {

@@ -38,7 +38,8 @@ std::string Timestamp::asString(TimeDomain domain, Format format) const {
   const long long milliseconds = static_cast<long long>(time.tv_usec) / 1000;
 
   if ((format & (kFormatDate | kFormatDateWithZone)) == 0) {
-    // The fraction is deliberately unpadded: readers of these names parse it as a number.
+    // Unpadded on purpose (5 ms reads ".5"): names already written in this form must keep
+    // sorting and parsing the same way. Only the date forms pad.
     std::string text = std::to_string(static_cast<long long>(time.tv_sec));
     if ((format & kFormatMicroseconds) != 0) {
       text += "." + std::to_string(static_cast<long long>(time.tv_usec));

@@ -1,0 +1,38 @@
+// Start-up against the real process table: the simulator keeps processes with the daemons'
+// names alive for as long as it runs.
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "tests/tool_e2e/ToolRun.h"
+
+namespace halvex::e2e {
+namespace {
+
+TEST(DaemonCheck, NeitherDaemonOnAnOrdinaryProductRefusesToStart) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, R"({"device": {"product_type": 57}, "processes": ["telvane"]})");
+  const test::RunResult run = runTool({"logdump", "tel"});
+  EXPECT_EQ(run.status.describe(), "exit 255");
+  EXPECT_EQ(
+      run.out,
+      "Telvane process is not running. Please run/load Telvane (or kelmond) and try again.\n");
+  EXPECT_EQ(run.err, "");
+}
+
+TEST(DaemonCheck, EitherDaemonLetsTheToolStart) {
+  for (const std::string daemon : {"Telvane", "kelmond"}) {
+    SCOPED_TRACE(daemon);
+    test::PrivateBus bus;
+    test::SimProcess sim(
+        bus, R"({"device": {"product_type": 0}, "processes": [")" + daemon +
+                 R"("], "server": {"commands": {"TraceDumpState": {"timestamp": "T"}}}})");
+    const test::RunResult run = runTool({"logdump", "tel"});
+    EXPECT_EQ(run.status.describe(), "exit 0");
+    EXPECT_EQ(run.out, "Telephony log collection: Success\nPath = " + kSnapshot + "T.tar.gz\n");
+    EXPECT_EQ(run.err, "");
+  }
+}
+
+}  // namespace
+}  // namespace halvex::e2e

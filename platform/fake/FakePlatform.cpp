@@ -15,8 +15,8 @@ namespace halvex::client {
 
 class Manager {
  public:
-  Manager(std::string clientName, WorkQueue queue)
-      : client(std::move(clientName)), queue(std::move(queue)) {}
+  Manager(std::string clientName, WorkQueue callbackQueue)
+      : client(std::move(clientName)), queue(std::move(callbackQueue)) {}
 
   const std::string client;
   const WorkQueue queue;
@@ -195,7 +195,7 @@ std::vector<LogLine> FakePlatform::logLines() const {
 
 namespace {
 
-halvex::fake::FakePlatform::Impl& fake() {
+halvex::fake::FakePlatform::Impl& fakeImpl() {
   return halvex::fake::FakePlatform::get().impl();
 }
 
@@ -204,36 +204,36 @@ halvex::fake::FakePlatform::Impl& fake() {
 namespace halvex::device {
 
 int getRadioType() {
-  return fake().read(&fake::Device::radioType, "getRadioType");
+  return fakeImpl().read(&fake::Device::radioType, "getRadioType");
 }
 int getRadioVendor() {
-  return fake().read(&fake::Device::radioVendor, "getRadioVendor");
+  return fakeImpl().read(&fake::Device::radioVendor, "getRadioVendor");
 }
 int getProductType() {
-  return fake().read(&fake::Device::productType, "getProductType");
+  return fakeImpl().read(&fake::Device::productType, "getProductType");
 }
 bool isInternalBuild() {
-  return fake().read(&fake::Device::internalBuild, "isInternalBuild");
+  return fakeImpl().read(&fake::Device::internalBuild, "isInternalBuild");
 }
 bool isCarrierBuild() {
-  return fake().read(&fake::Device::carrierBuild, "isCarrierBuild");
+  return fakeImpl().read(&fake::Device::carrierBuild, "isCarrierBuild");
 }
 bool isVendorBuild() {
-  return fake().read(&fake::Device::vendorBuild, "isVendorBuild");
+  return fakeImpl().read(&fake::Device::vendorBuild, "isVendorBuild");
 }
 bool isTraceAllowed() {
-  return fake().read(&fake::Device::traceAllowed, "isTraceAllowed");
+  return fakeImpl().read(&fake::Device::traceAllowed, "isTraceAllowed");
 }
 
 bool isProcessRunning(const std::string& name) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   std::lock_guard lock(impl.mutex);
   impl.calls.push_back("isProcessRunning:" + name);
   return impl.device.runningProcesses.count(name) != 0;
 }
 
 std::string getProgramName() {
-  return fake().read(&fake::Device::programName, "getProgramName");
+  return fakeImpl().read(&fake::Device::programName, "getProgramName");
 }
 
 }  // namespace halvex::device
@@ -245,14 +245,14 @@ namespace {
 class FakePropertyService final : public DevicePropertyService {
  public:
   std::map<std::string, std::string> getPropertyMap() override {
-    return fake().read(&fake::Device::properties, "getPropertyMap");
+    return fakeImpl().read(&fake::Device::properties, "getPropertyMap");
   }
 };
 
 class FakeLogServer final : public LogServer {
  public:
   void write(const LogContext& context, LogLevel level, std::string_view message) override {
-    auto& impl = fake();
+    auto& impl = fakeImpl();
     std::lock_guard lock(impl.mutex);
     impl.logLines.push_back({context.subsystem(), context.category(), level, std::string(message)});
   }
@@ -264,7 +264,7 @@ class FakeHelperClient final : public HelperClient {
 
   Result perform(helper::TaskID task, const char* command, MessageDict request,
                  MessageValue& reply) override {
-    auto& impl = fake();
+    auto& impl = fakeImpl();
     fake::FakePlatform::HelperResponder responder;
     {
       std::lock_guard lock(impl.mutex);
@@ -286,18 +286,18 @@ class FakeHelperClient final : public HelperClient {
 }  // namespace
 
 std::shared_ptr<DevicePropertyService> DevicePropertyService::create() {
-  fake().record("DevicePropertyService::create");
+  fakeImpl().record("DevicePropertyService::create");
   return std::make_shared<FakePropertyService>();
 }
 
 std::shared_ptr<LogServer> LogServer::create() {
-  fake().record("LogServer::create");
+  fakeImpl().record("LogServer::create");
   return std::make_shared<FakeLogServer>();
 }
 
 std::shared_ptr<HelperClient> HelperClient::create(const char* serviceName,
                                                    std::shared_ptr<LogServer> /*logger*/) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   std::lock_guard lock(impl.mutex);
   impl.calls.push_back(std::string("HelperClient::create:") + serviceName);
   if (!impl.helperCreatable) {
@@ -311,7 +311,7 @@ std::shared_ptr<HelperClient> HelperClient::create(const char* serviceName,
 namespace halvex::client {
 
 std::shared_ptr<Manager> CreateManager(const std::string& clientName, WorkQueue queue) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   auto manager = std::make_shared<Manager>(clientName, std::move(queue));
   std::lock_guard lock(impl.mutex);
   impl.calls.push_back("CreateManager:" + clientName);
@@ -321,14 +321,14 @@ std::shared_ptr<Manager> CreateManager(const std::string& clientName, WorkQueue 
 
 void RegisterEventHandler(const std::shared_ptr<Manager>& manager, const std::string& event,
                           EventHandler handler) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   std::lock_guard lock(impl.mutex);
   impl.calls.push_back("RegisterEventHandler:" + event);
   manager->handlers[event] = std::move(handler);
 }
 
 void EventsOff(const std::shared_ptr<Manager>& manager) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   std::lock_guard lock(impl.mutex);
   impl.calls.emplace_back("EventsOff");
   manager->eventsOn = false;
@@ -336,7 +336,7 @@ void EventsOff(const std::shared_ptr<Manager>& manager) {
 }
 
 void EventsOn(const std::shared_ptr<Manager>& manager) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   std::lock_guard lock(impl.mutex);
   impl.calls.emplace_back("EventsOn");
   manager->eventsOn = true;
@@ -349,7 +349,7 @@ namespace {
 
 fake::Answer answerServer(const std::shared_ptr<Manager>& manager, const std::string& command,
                           const MessageDict& request, bool asynchronous) {
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   fake::FakePlatform::ServerResponder responder;
   {
     std::lock_guard lock(impl.mutex);
@@ -376,7 +376,7 @@ void PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& 
                                 answer = std::move(answer)]() mutable {
     completion(answer.result, answer.result.ok() ? answer.reply : MessageValue());
   };
-  auto& impl = fake();
+  auto& impl = fakeImpl();
   {
     std::lock_guard lock(impl.mutex);
     if (impl.holding) {
@@ -392,7 +392,7 @@ void PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& 
 namespace halvex::platform {
 
 void runMainLoop() {
-  fake().record("runMainLoop");
+  fakeImpl().record("runMainLoop");
 }
 
 }  // namespace halvex::platform

@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <ctime>
 
 #include "platform/linux/MessageCodec.h"
 #include "platform/linux/detail/BusString.h"
@@ -39,7 +40,22 @@ std::int32_t codeForLocalErrno(int r) {
 
 }  // namespace
 
-Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r) {
+std::uint64_t monotonicUsec() {
+  timespec now{};
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return static_cast<std::uint64_t>(now.tv_sec) * 1000000u +
+         static_cast<std::uint64_t>(now.tv_nsec) / 1000u;
+}
+
+std::uint64_t callDeadline(sd_bus* bus) {
+  std::uint64_t timeout = 0;
+  if (sd_bus_get_method_call_timeout(bus, &timeout) < 0 || timeout == 0) {
+    return UINT64_MAX;
+  }
+  return monotonicUsec() + timeout;
+}
+
+Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r, bool deadlinePassed) {
   const bool named = error != nullptr && sd_bus_error_is_set(error);
   std::string text = named ? std::string(error->name) : std::string("errno ") + std::to_string(-r);
   if (named && error->message != nullptr) {
@@ -58,9 +74,10 @@ Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r) {
   if (sd_bus_error_has_names(error, SD_BUS_ERROR_NAME_HAS_NO_OWNER, SD_BUS_ERROR_SERVICE_UNKNOWN)) {
     return makeResult(kResultServerNotRunning, text);
   }
-  // The errno is -ETIMEDOUT for both of these; only the name tells a crash from a slow peer.
+  // The errno is -ETIMEDOUT for all of these; the name and the clock tell a crash from a slow
+  // peer.
   if (sd_bus_error_has_name(error, SD_BUS_ERROR_NO_REPLY)) {
-    return makeResult(kResultServerGone, text);
+    return makeResult(deadlinePassed ? kResultTimeout : kResultServerGone, text);
   }
   if (sd_bus_error_has_name(error, SD_BUS_ERROR_TIMEOUT)) {
     return makeResult(kResultTimeout, text);
@@ -120,9 +137,10 @@ Result callSync(sd_bus* bus, const char* destination, const char* path, const ch
   }
   sd_bus_error error = SD_BUS_ERROR_NULL;
   sd_bus_message* answer = nullptr;
+  std::uint64_t deadline = callDeadline(bus);
   r = sd_bus_call(bus, call.get(), 0, &error, &answer);
   if (r < 0) {
-    Result result = resultFromFailure(bus, &error, r);
+    Result result = resultFromFailure(bus, &error, r, monotonicUsec() >= deadline);
     sd_bus_error_free(&error);
     return result;
   }

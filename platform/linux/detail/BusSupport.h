@@ -57,8 +57,15 @@ Result makeResult(std::int32_t code, std::string_view message);
 
 // The outcome of a call that failed: error is the bus error (may be unset) and r the negative
 // errno sd-bus returned. bus is the connection the call went out on; once it is no longer open,
-// every failure is our connection's fault, whatever name sd-bus gave it.
-Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r);
+// every failure is our connection's fault, whatever name sd-bus gave it. deadlinePassed says
+// that the call's time-out had run out when the failure came: sd-bus reports its own time-out of
+// an asynchronous call as NoReply, under the same sender as a peer that crashed.
+Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r,
+                         bool deadlinePassed = false);
+
+// The monotonic time, and the moment a call sent now on bus times out.
+std::uint64_t monotonicUsec();
+std::uint64_t callDeadline(sd_bus* bus);
 
 // The outcome when sd_bus_open_system itself failed with r: there is no bus to reach anyone on.
 Result resultFromOpenFailure(int r);

@@ -223,6 +223,7 @@ void BusThread::callAsync(const char* destination, const char* path, const char*
   auto pending = std::make_unique<Pending>();
   pending->owner = this;
   pending->id = ++nextCallId_;
+  pending->deadline = callDeadline(bus);
   r = sd_bus_call_async(bus, &pending->slot, call.get(), &BusThread::onReply, pending.get(), 0);
   if (r < 0) {
     done(resultFromFailure(bus, nullptr, r), nullptr);
@@ -275,9 +276,10 @@ int BusThread::onReply(sd_bus_message* reply, void* userdata, sd_bus_error*) {
   sd_bus_slot_unref(pending->slot);
   pending->slot = nullptr;
   if (sd_bus_message_is_method_error(reply, nullptr) > 0) {
-    pending->done(resultFromFailure(sd_bus_message_get_bus(reply), sd_bus_message_get_error(reply),
-                                    -sd_bus_message_get_errno(reply)),
-                  nullptr);
+    pending->done(
+        resultFromFailure(sd_bus_message_get_bus(reply), sd_bus_message_get_error(reply),
+                          -sd_bus_message_get_errno(reply), monotonicUsec() >= pending->deadline),
+        nullptr);
   } else {
     pending->done(Result{}, reply);
   }

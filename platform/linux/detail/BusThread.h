@@ -86,6 +86,7 @@ class BusThread {
   struct Pending {
     BusThread* owner = nullptr;
     std::uint64_t id = 0;
+    std::uint64_t deadline = 0;
     sd_bus_slot* slot = nullptr;
     ReplyHandler done;
   };

@@ -1,0 +1,159 @@
+// Latency of one command through the client framework against a bare sd_bus_call of the same
+// method on the same bus. Needs DBUS_SYSTEM_BUS_ADDRESS and a running halvex-sim; see
+// run-client-bench.sh. After the runs it prints how much each framework path costs relative to
+// the bare call.
+#include <benchmark/benchmark.h>
+#include <systemd/sd-bus.h>
+
+#include <condition_variable>
+#include <cstdio>
+#include <map>
+#include <mutex>
+#include <string>
+
+#include "platform/ServerClient.h"
+#include "platform/linux/MessageCodec.h"
+#include "platform/linux/detail/BusSupport.h"
+
+namespace {
+
+using namespace halvex;
+
+// The simulator answers a command it has no entry for at once with an empty dictionary.
+constexpr char kCommand[] = "BenchEcho";
+constexpr double kTargetRatio = 1.5;
+
+MessageDict sampleRequest() {
+  MessageDict request;
+  request.set("TraceAction", MessageValue::string("CollectTelephonyLogs"));
+  request.set("TraceDumpStatePerformCompression", MessageValue::boolean(true));
+  request.set("Attempt", MessageValue::int64(1));
+  return request;
+}
+
+void BM_BareCall(benchmark::State& state) {
+  sd_bus* raw = nullptr;
+  if (sd_bus_open_system(&raw) < 0) {
+    state.SkipWithError("no system bus");
+    return;
+  }
+  bus::BusPtr connection(raw);
+  const MessageDict request = sampleRequest();
+  for (auto _ : state) {
+    bus::MessagePtr reply;
+    Result result = bus::callSync(
+        connection.get(), bus::kServerName, bus::kServerPath, bus::kServerInterface,
+        "PerformCommand",
+        [&](sd_bus_message* message) {
+          int r = sd_bus_message_append(message, "ss", "bench", kCommand);
+          return r < 0 ? r : bus::appendDict(message, request);
+        },
+        reply);
+    MessageValue value;
+    if (result.ok()) {
+      result = bus::readOutcome(reply.get(), value);
+    }
+    if (!result.ok()) {
+      state.SkipWithError(result.message.c_str());
+      return;
+    }
+    benchmark::DoNotOptimize(value);
+  }
+}
+
+void BM_SyncPerform(benchmark::State& state) {
+  auto manager = client::CreateManager("bench", WorkQueue::create("bench.queue"));
+  const MessageDict request = sampleRequest();
+  for (auto _ : state) {
+    MessageValue reply;
+    Result result = client::PerformCommand(manager, kCommand, request, reply);
+    if (!result.ok()) {
+      state.SkipWithError(result.message.c_str());
+      return;
+    }
+    benchmark::DoNotOptimize(reply);
+  }
+}
+
+void BM_AsyncPerform(benchmark::State& state) {
+  auto manager = client::CreateManager("bench", WorkQueue::create("bench.queue"));
+  const MessageDict request = sampleRequest();
+  std::mutex mutex;
+  std::condition_variable done;
+  bool finished = false;
+  Result last;
+  for (auto _ : state) {
+    finished = false;
+    client::PerformCommand(
+        manager, kCommand,
+        [&](Result result, MessageValue) {
+          std::lock_guard lock(mutex);
+          last = std::move(result);
+          finished = true;
+          done.notify_one();
+        },
+        request);
+    std::unique_lock lock(mutex);
+    done.wait(lock, [&] { return finished; });
+    if (!last.ok()) {
+      state.SkipWithError(last.message.c_str());
+      return;
+    }
+  }
+}
+
+BENCHMARK(BM_BareCall)->UseRealTime()->MinTime(2.0);
+BENCHMARK(BM_SyncPerform)->UseRealTime()->MinTime(2.0);
+BENCHMARK(BM_AsyncPerform)->UseRealTime()->MinTime(2.0);
+
+// Keeps each benchmark's time per iteration for the comparison at the end.
+class RatioReporter : public benchmark::ConsoleReporter {
+ public:
+  void ReportRuns(const std::vector<Run>& runs) override {
+    for (const Run& run : runs) {
+      if (!run.error_occurred && run.run_type == Run::RT_Iteration) {
+        times_[run.run_name.function_name] = run.GetAdjustedRealTime();
+      }
+    }
+    ConsoleReporter::ReportRuns(runs);
+  }
+
+  // Prints the ratios; false when a path is missing or slower than the target.
+  bool summarize() const {
+    auto bare = times_.find("BM_BareCall");
+    if (bare == times_.end() || bare->second <= 0) {
+      std::printf("no bare-call measurement to compare with\n");
+      return false;
+    }
+    bool ok = true;
+    for (const char* name : {"BM_SyncPerform", "BM_AsyncPerform"}) {
+      auto it = times_.find(name);
+      if (it == times_.end()) {
+        std::printf("%s: no measurement\n", name);
+        ok = false;
+        continue;
+      }
+      double ratio = it->second / bare->second;
+      std::printf("%s / bare sd_bus_call: %.2fx (target %.1fx) %s\n", name, ratio, kTargetRatio,
+                  ratio <= kTargetRatio ? "ok" : "SLOWER THAN TARGET");
+      ok = ok && ratio <= kTargetRatio;
+    }
+    return ok;
+  }
+
+ private:
+  std::map<std::string, double> times_;
+};
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  benchmark::Initialize(&argc, argv);
+  if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
+    return 2;
+  }
+  RatioReporter reporter;
+  benchmark::RunSpecifiedBenchmarks(&reporter);
+  benchmark::Shutdown();
+  return reporter.summarize() ? 0 : 1;
+}

@@ -40,7 +40,7 @@ struct StartupRow {
   std::vector<std::string> queries;
 };
 
-TEST(Startup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
+TEST(ToolStartup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
   const std::vector<std::string> telvaneAndExempt = {"getRadioType", "isProcessRunning:Telvane",
                                                      "getProductType"};
   std::vector<std::string> withKelmond = telvaneAndExempt;
@@ -84,7 +84,7 @@ TEST(Startup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
   }
 }
 
-TEST(Startup, ArgumentsAreKeptWholeAndInOrder) {
+TEST(ToolStartup, ArgumentsAreKeptWholeAndInOrder) {
   char program[] = "/usr/local/bin/halvextool";
   char spaced[] = "two words";
   char empty[] = "";
@@ -96,7 +96,7 @@ TEST(Startup, ArgumentsAreKeptWholeAndInOrder) {
 
 // The shell thread's entry ends the process with the shell's verdict. Death tests re-run this
 // test in a child process, with the same fake set-up, so the shell runs there.
-TEST(StartupDeathTest, ShellThreadExitsWithTheRunsResult) {
+TEST(ToolStartupDeathTest, ShellThreadExitsWithTheRunsResult) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   ServerScript script;
   script.enabled = tooltest::failed(kResultTimeout);
@@ -118,7 +118,7 @@ TEST(StartupDeathTest, ShellThreadExitsWithTheRunsResult) {
   }
 }
 
-TEST(StartupDeathTest, MainRunsTheShellOnItsOwnThread) {
+TEST(ToolStartupDeathTest, MainRunsTheShellOnItsOwnThread) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   fake::Device device;
   device.runningProcesses = {"Telvane"};

@@ -17,7 +17,7 @@ MessageValue stateEvent(MessageValue state) {
 
 // Each event overwrites the flag, so the rows run in order and every "not started" row follows a
 // "started" one.
-TEST(ServerState, EveryEventOverwritesTheFlag) {
+TEST(ServerStateFlag, EveryEventOverwritesTheFlag) {
   EXPECT_FALSE(isServerStarted());
 
   const MessageValue started = stateEvent(MessageValue::string(kServerStateStarted));

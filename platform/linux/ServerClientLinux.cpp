@@ -256,7 +256,12 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
   }
 
   void onConnected(sd_bus* bus) {
-    owner_.clear();
+    // An owner seen on a connection that went without its Disconnected signal (we noticed first)
+    // is unknown now; the new connection's owner query tells whether it is still there.
+    if (!owner_.empty()) {
+      owner_.clear();
+      postStopped();
+    }
     // The matches go first: the bus handles our messages in order, so no owner change after the
     // owner query can slip by unseen. A match that cannot be installed costs us its signals but
     // not the connection, which sd-bus would close without an install callback.

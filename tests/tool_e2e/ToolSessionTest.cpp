@@ -95,6 +95,7 @@ TEST(ToolSession, BasebandFallsBackToTheHelperWhenTheServerReportsItselfDown) {
   EXPECT_EQ(requests[2]["command"], "TraceDumpState");
   EXPECT_EQ(requests[3],
             (json{{"service", "helper"},
+                  {"method", "Perform"},
                   {"client", "logdump.helper"},
                   {"task", 4},
                   {"command", "VarniskStatus"},

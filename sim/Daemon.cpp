@@ -342,18 +342,18 @@ Daemon::Impl::Deferred* Daemon::Impl::defer(Endpoint* owner, std::uint32_t delay
   Deferred* raw = item.get();
   sd_event_source* source = nullptr;
   int r = 0;
-  if (!raw->fire) {
-    // A request kept unanswered: no source at all.
-  } else if (delayMs == 0) {
+  // Without fire it is a request kept unanswered, and needs no source.
+  if (raw->fire && delayMs == 0) {
     r = sd_event_add_defer(event.get(), &source, &Impl::onDefer, raw);
-  } else {
+  } else if (raw->fire) {
     std::uint64_t now = 0;
     sd_event_now(event.get(), CLOCK_MONOTONIC, &now);
     r = sd_event_add_time(event.get(), &source, CLOCK_MONOTONIC,
                           now + std::uint64_t{delayMs} * 1000U, 1000U, &Impl::onTimer, raw);
   }
-  if (r < 0)
+  if (r < 0) {
     throw std::runtime_error(std::string("cannot schedule: ") + std::strerror(-r));
+  }
   raw->source.reset(source);
   deferred.push_back(std::move(item));
   return raw;

@@ -493,11 +493,15 @@ TEST(SimBus, KeepsNamedProcessesAliveWhileItRuns) {
   EXPECT_TRUE(gone);
 }
 
-TEST(SimBus, TerminatesCleanlyOnSigterm) {
-  PrivateBus bus;
-  SimProcess sim(bus, "{}");
-  sim.kill(SIGTERM);
-  EXPECT_EQ(sim.waitExit().describe(), "exit 0");
+TEST(SimBus, EndsOnSigtermCleanlyAndOnLossOfTheBusWithFailure) {
+  // One simulator a bus: the control name is unique.
+  PrivateBus bus, doomedBus;
+  SimProcess stopped(bus, "{}");
+  SimProcess orphaned(doomedBus, "{}");
+  stopped.kill(SIGTERM);
+  EXPECT_EQ(stopped.waitExit().describe(), "exit 0");
+  doomedBus.stop();
+  EXPECT_EQ(orphaned.waitExit().describe(), "exit 1");
 }
 
 TEST(SimCommandLine, BadInputExitsTwoWithOneLineNamingThePlace) {

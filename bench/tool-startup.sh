@@ -24,19 +24,35 @@ for command in hyperfine jq /usr/bin/time; do
   command -v "${command}" >/dev/null || { echo "needs ${command}" >&2; exit 2; }
 done
 
-source "${top}/scripts/simulated-device.sh"
 work=$(mktemp -d /tmp/halvex-tool-startup.XXXXXX)
+bus_pid="" sim_pid=""
 cleanup() {
-  stop_simulated_device
+  [[ -n ${sim_pid} ]] && kill "${sim_pid}" 2>/dev/null && wait "${sim_pid}" 2>/dev/null
+  [[ -n ${bus_pid} ]] && kill "${bus_pid}" 2>/dev/null
   rm -rf "${work}"
 }
 trap cleanup EXIT
 
+# A private system bus, as the demo uses.
+dbus-daemon --config-file="${top}/scripts/private-bus.conf" --fork \
+  --print-address=3 --print-pid=4 3>"${work}/address" 4>"${work}/pid" 2>/dev/null
+bus_pid=$(head -n1 "${work}/pid")
+DBUS_SYSTEM_BUS_ADDRESS=$(head -n1 "${work}/address")
+export DBUS_SYSTEM_BUS_ADDRESS
+
 # The simulator's defaults (server started, baseband logs enabled, mode 0) on a product that
-# needs no telephony daemon, so the bench starts no process named like one. The request log goes
-# to /dev/null so that disk speed stays out of the measurement.
+# needs no telephony daemon, so the bench starts no process named like one. No log root: writing
+# real log sets is the simulated server's work, not the tool's, and would swamp what is measured;
+# the request log goes to /dev/null for the same reason.
 echo '{"device": {"product_type": 58}}' >"${work}/scenario.json"
-start_simulated_device "${sim}" "${work}/scenario.json" "${work}/root" /dev/null
+mkfifo "${work}/ready"
+"${sim}" --scenario "${work}/scenario.json" --request-log /dev/null --ready-fd 5 \
+  5>"${work}/ready" &
+sim_pid=$!
+if ! read -r -t 10 line <"${work}/ready" || [[ ${line} != ready ]]; then
+  echo "halvex-sim did not get ready" >&2
+  exit 1
+fi
 
 # A run that does not collect would measure the wrong thing.
 if ! "${tool}" logdump tel >"${work}/first.out" 2>&1 ||

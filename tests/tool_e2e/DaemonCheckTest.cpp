@@ -2,6 +2,8 @@
 // names alive for as long as it runs.
 #include <gtest/gtest.h>
 
+#include <filesystem>
+#include <fstream>
 #include <string>
 
 #include "tests/tool_e2e/ToolRun.h"
@@ -9,7 +11,23 @@
 namespace halvex::e2e {
 namespace {
 
+// Processes on this machine whose name is exactly one of the daemons', as "pid name".
+std::string daemonsRunningElsewhere() {
+  std::string found;
+  for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+    std::ifstream comm(entry.path() / "comm");
+    std::string name;
+    if (std::getline(comm, name) && (name == "Telvane" || name == "kelmond")) {
+      found += entry.path().filename().string() + " " + name + "; ";
+    }
+  }
+  return found;
+}
+
 TEST(DaemonCheck, NeitherDaemonOnAnOrdinaryProductRefusesToStart) {
+  // Tests that keep such processes alive hold the daemon_names lock; anything else is a process
+  // this test cannot control.
+  ASSERT_EQ(daemonsRunningElsewhere(), "") << "processes named like the daemons already run";
   test::PrivateBus bus;
   test::SimProcess sim(bus, R"({"device": {"product_type": 57}, "processes": ["telvane"]})");
   const test::RunResult run = runTool({"logdump", "tel"});

@@ -175,111 +175,79 @@ TEST(LogCollection, BasebandOutcomes) {
             });
 }
 
-TEST(LogCollection, RequestsCarryTheWordsInKeyOrder) {
+// Each request as "command sync|async {keys}", so a row states every request in order.
+std::string sent(const std::string& command, bool asynchronous, const MessageDict& request) {
+  return command + (asynchronous ? " async " : " sync ") + describe(MessageValue::dict(request));
+}
+
+TEST(LogCollection, RequestsFollowTheWordsInKeyOrder) {
   ServerScript().install();
   auto str = [](const char* text) { return MessageValue::string(text); };
-  auto tel = [&](const char* reason, bool compression, bool confirmation) {
-    std::vector<std::pair<std::string, MessageValue>> keys = {
-        {kKeyTraceAction, str(kCollectTelephonyLogs)},
-        {kKeyTraceDumpStateReason, str(reason)},
-        {kKeyTraceDumpStatePerformCompression, MessageValue::boolean(compression)}};
+  auto flag = [](bool value) { return MessageValue::boolean(value); };
+  const std::string modeQuery =
+      sent(kCommandGetTraceProperty, false,
+           *tooltest::dictOf({{kKeyTraceName, str(kTraceSystemLogs)},
+                              {kKeyTracePropertyName, str(kKeyTraceMode)}})
+                .asDict());
+  const std::string enabledQuery =
+      sent(kCommandGetTraceProperty, false,
+           *tooltest::dictOf({{kKeyTraceName, str(kTraceBaseband)},
+                              {kKeyTracePropertyName, str(kKeyTraceEnabled)}})
+                .asDict());
+  // The dump requests; a trailing confirmation key appears only with "nonui".
+  auto dump = [&](std::vector<std::pair<std::string, MessageValue>> keys, bool confirmation,
+                  bool asynchronous) {
     if (confirmation) {
-      keys.emplace_back(kKeyTraceUserConfirmation, MessageValue::boolean(false));
+      keys.emplace_back(kKeyTraceUserConfirmation, flag(false));
     }
-    return *tooltest::dictOf(keys).asDict();
+    return sent(kCommandTraceDumpState, asynchronous, *tooltest::dictOf(keys).asDict());
+  };
+  auto tel = [&](const char* reason, bool compression, bool confirmation) {
+    return dump({{kKeyTraceAction, str(kCollectTelephonyLogs)},
+                 {kKeyTraceDumpStateReason, str(reason)},
+                 {kKeyTraceDumpStatePerformCompression, flag(compression)}},
+                confirmation, true);
   };
   auto core = [&](const char* reason, bool compression, bool confirmation) {
-    std::vector<std::pair<std::string, MessageValue>> keys = {
-        {kKeyBasebandResetType, str(kBasebandResetTypeHard)},
-        {kKeyBasebandResetSubType, str(kBasebandResetSubTypeOtherErrors)},
-        {kKeyTraceAction, str(kCollectTelephonyLogsWithCoredump)},
-        {kKeyBasebandResetReason, str(reason)},
-        {kKeyTraceDumpStatePerformCompression, MessageValue::boolean(compression)}};
-    if (confirmation) {
-      keys.emplace_back(kKeyTraceUserConfirmation, MessageValue::boolean(false));
-    }
-    return *tooltest::dictOf(keys).asDict();
+    return dump({{kKeyBasebandResetType, str(kBasebandResetTypeHard)},
+                 {kKeyBasebandResetSubType, str(kBasebandResetSubTypeOtherErrors)},
+                 {kKeyTraceAction, str(kCollectTelephonyLogsWithCoredump)},
+                 {kKeyBasebandResetReason, str(reason)},
+                 {kKeyTraceDumpStatePerformCompression, flag(compression)}},
+                confirmation, true);
   };
   auto bb = [&](const char* reason, bool compression) {
-    return *tooltest::dictOf(
-                {{kKeyTraceDumpStateReason, str(reason)},
+    return dump({{kKeyTraceDumpStateReason, str(reason)},
                  {kKeyTraceAction, str(kCollectBasebandLogs)},
-                 {kKeyTraceDumpStatePerformCompression, MessageValue::boolean(compression)}})
-                .asDict();
+                 {kKeyTraceDumpStatePerformCompression, flag(compression)}},
+                false, false);
   };
   struct RequestRow {
     std::string option;
     std::vector<std::string> words;
-    MessageDict request;
-    bool asynchronous;
+    std::vector<std::string> requests;
   };
   const RequestRow rows[] = {
-      {"tel", {}, tel(kDefaultReason, true, false), true},
-      {"tel", {"nonui"}, tel(kDefaultReason, true, true), true},
-      {"tel", {"nocompress", "nonui", "crash1"}, tel("[halvextool] crash1", false, true), true},
-      {"tel", {"crash1", "nonui"}, tel("[halvextool] crash1", true, false), true},
-      {"core", {}, core(kDefaultReason, true, false), true},
-      {"core", {"nonui", "why"}, core("[halvextool] why", true, true), true},
-      {"core", {"nocompress"}, core(kDefaultReason, false, false), true},
-      {"bb", {}, bb(kDefaultReason, true), false},
-      {"bb", {"nonui", "nocompress", "modem"}, bb("[halvextool] modem", false), false},
+      {"tel", {}, {modeQuery, tel(kDefaultReason, true, false)}},
+      {"tel", {"nonui"}, {modeQuery, tel(kDefaultReason, true, true)}},
+      {"tel", {"nocompress", "nonui", "crash1"}, {tel("[halvextool] crash1", false, true)}},
+      {"tel", {"crash1", "nocompress"}, {modeQuery, tel("[halvextool] crash1", true, false)}},
+      {"core", {}, {core(kDefaultReason, true, false)}},
+      {"core", {"nonui", "why"}, {core("[halvextool] why", true, true)}},
+      {"core", {"nocompress"}, {core(kDefaultReason, false, false)}},
+      {"bb", {}, {enabledQuery, modeQuery, bb(kDefaultReason, true)}},
+      {"bb", {"nonui", "nocompress", "modem"}, {enabledQuery, bb("[halvextool] modem", false)}},
   };
   for (const RequestRow& row : rows) {
     SCOPED_TRACE(row.option + " " + testing::PrintToString(row.words));
     const std::size_t before = FakePlatform::get().serverRequests().size();
     runLogdump(row.option, row.words);
-    const auto requests = tooltest::requestsSince(before);
-    ASSERT_FALSE(requests.empty());
-    const fake::ServerRequest& dump = requests.back();
-    EXPECT_EQ(dump.command, kCommandTraceDumpState);
-    EXPECT_EQ(dump.client, "halvextool");
-    EXPECT_EQ(dump.asynchronous, row.asynchronous);
-    EXPECT_EQ(dump.request, row.request) << describe(MessageValue::dict(dump.request));
-  }
-}
-
-// Which queries come before the dump, by option and words.
-TEST(LogCollection, OnlyTheNeededPropertyQueriesAreMade) {
-  ServerScript script;
-  script.mode = propertyValue("3");
-  script.install();
-  const MessageDict modeQuery =
-      *tooltest::dictOf({{kKeyTraceName, MessageValue::string(kTraceSystemLogs)},
-                         {kKeyTracePropertyName, MessageValue::string(kKeyTraceMode)}})
-           .asDict();
-  const MessageDict enabledQuery =
-      *tooltest::dictOf({{kKeyTraceName, MessageValue::string(kTraceBaseband)},
-                         {kKeyTracePropertyName, MessageValue::string(kKeyTraceEnabled)}})
-           .asDict();
-  struct QueryRow {
-    std::string option;
-    std::vector<std::string> words;
-    std::vector<MessageDict> queries;
-  };
-  const QueryRow rows[] = {
-      {"tel", {}, {modeQuery}},
-      {"tel", {"nocompress"}, {}},
-      {"tel", {"nonui", "nocompress"}, {}},
-      {"tel", {"reason", "nocompress"}, {modeQuery}},
-      {"core", {}, {}},
-      {"core", {"nonui"}, {}},
-      {"bb", {}, {enabledQuery, modeQuery}},
-      {"bb", {"nocompress"}, {enabledQuery}},
-  };
-  for (const QueryRow& row : rows) {
-    SCOPED_TRACE(row.option + " " + testing::PrintToString(row.words));
-    const std::size_t before = FakePlatform::get().serverRequests().size();
-    runLogdump(row.option, row.words);
-    auto requests = tooltest::requestsSince(before);
-    ASSERT_FALSE(requests.empty());
-    requests.pop_back();  // the dump
-    std::vector<MessageDict> queries;
-    for (const auto& request : requests) {
-      EXPECT_EQ(request.command, kCommandGetTraceProperty);
-      EXPECT_FALSE(request.asynchronous);
-      queries.push_back(request.request);
+    std::vector<std::string> requests;
+    for (const fake::ServerRequest& request : tooltest::requestsSince(before)) {
+      EXPECT_EQ(request.client, "halvextool");
+      requests.push_back(sent(request.command, request.asynchronous, request.request));
     }
-    EXPECT_EQ(queries, row.queries);
+    EXPECT_EQ(requests, row.requests);
   }
 }
 

@@ -182,6 +182,16 @@ TEST_F(CodecTest, ForeignShapesAreRefusedWithoutCrashing) {
          appendRawNesting(m, kMaxDictDepth + 1);
          return sd_bus_message_close_container(m);
        }},
+      {"too many entries",
+       [](sd_bus_message* m) {
+         sd_bus_message_open_container(m, 'v', "a{sv}");
+         sd_bus_message_open_container(m, 'a', "{sv}");
+         for (std::size_t i = 0; i <= kMaxDictEntries; ++i) {
+           sd_bus_message_append(m, "{sv}", std::to_string(i).c_str(), "b", 1);
+         }
+         sd_bus_message_close_container(m);
+         return sd_bus_message_close_container(m);
+       }},
   };
   for (const auto& c : cases) {
     Message message(newMessage(), sd_bus_message_unref);
@@ -196,19 +206,6 @@ TEST_F(CodecTest, ForeignShapesAreRefusedWithoutCrashing) {
     EXPECT_LT(readDict(message.get(), dict), 0) << c.name;
     EXPECT_TRUE(dict.contains("kept")) << c.name;
   }
-}
-
-TEST_F(CodecTest, OversizedIncomingDictionaryIsRefused) {
-  Message message(newMessage(), sd_bus_message_unref);
-  ASSERT_GE(sd_bus_message_open_container(message.get(), 'a', "{sv}"), 0);
-  for (std::size_t i = 0; i <= kMaxDictEntries; ++i) {
-    std::string key = "k" + std::to_string(i);
-    ASSERT_GE(sd_bus_message_append(message.get(), "{sv}", key.c_str(), "b", 1), 0);
-  }
-  ASSERT_GE(sd_bus_message_close_container(message.get()), 0);
-  seal(message.get());
-  MessageDict dict;
-  EXPECT_EQ(readDict(message.get(), dict), -E2BIG);
 }
 
 TEST_F(CodecTest, RepeatedKeyKeepsFirstPositionAndLastValue) {

@@ -13,9 +13,9 @@
 
 namespace halvex {
 
-// A shell whose root command is connected to the server. Creating the root sets up the session:
-// the queue, the client manager and the state-event handler, then waits up to
-// kServerStateWait for the server's first state event before the first command runs.
+// A shell whose root command is connected to the server. Creating the root sets up the session
+// (the queue, the client manager and the state-event handler), then waits up to 500 ms for the
+// server's first state event before the first command runs.
 class HalvexShell : public CommandShell {
  public:
   HalvexShell() = default;

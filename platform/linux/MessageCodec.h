@@ -4,8 +4,8 @@
 //
 // Encoding checks the whole value before it appends anything, so a value that cannot be sent
 // leaves the message as it was. Decoding stops at the first fault; the message's read position is
-// then unspecified and the caller should treat the whole message as bad. Decoded output is only
-// complete when the call returns 0.
+// then wherever the fault was found and the caller should treat the whole message as bad. Decoded
+// output is only complete when the call returns 0.
 #pragma once
 
 #include <systemd/sd-bus.h>

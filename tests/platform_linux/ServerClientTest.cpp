@@ -330,6 +330,42 @@ TEST_F(ManagerTest, PendingCallsAreBoundedAndEachCompletesOnce) {
   EXPECT_EQ(codes[kResultLimitsExceeded] + codes[kResultConnectionLost], kCalls);
 }
 
+TEST_F(ManagerTest, ManyThreadsShareOneManager) {
+  start("{}");
+  listen(kEventServerStateChange);
+  constexpr int kThreads = 4;
+  constexpr int kCalls = 40;
+  std::vector<std::thread> callers;
+  std::atomic<int> failures{0};
+  for (int t = 0; t < kThreads; ++t) {
+    callers.emplace_back([&, t] {
+      for (int i = 0; i < kCalls; ++i) {
+        MessageValue reply;
+        if (!client::PerformCommand(manager_, "Sync", sampleRequest(), reply).ok()) {
+          ++failures;
+        }
+        client::PerformCommand(manager_, "Async", record("async"), sampleRequest());
+        // Switching delivery while calls fly must not disturb them.
+        if ((i + t) % 2 == 0) {
+          client::EventsOn(manager_);
+        } else {
+          client::EventsOff(manager_);
+        }
+      }
+    });
+  }
+  for (std::thread& caller : callers) {
+    caller.join();
+  }
+  EXPECT_EQ(failures.load(), 0);
+  ASSERT_TRUE(mail_.waitFor(kThreads * kCalls, "async"));
+  ASSERT_TRUE(drain(*queue_));
+  EXPECT_EQ(mail_.count("async"), static_cast<std::size_t>(kThreads * kCalls));
+  for (const Delivery& done : mail_.all("async")) {
+    EXPECT_TRUE(done.result.ok() && done.onQueue) << done.result.message;
+  }
+}
+
 TEST_F(ManagerTest, EventsFollowTheServerComingAndGoing) {
   start(R"({"server": {"present": false}})");
   listen(kEventServerStateChange);

@@ -1,15 +1,19 @@
 // Device queries on a Linux host: the identity comes from org.halvex.Device over the system bus,
 // processes from /proc.
 //
-// Every identity query opens a connection of its own, asks GetIdentity and closes it again. That
-// costs a millisecond or so, but these queries are rare, may come from any thread, and must answer
-// afresh each time; a connection per call shares nothing between threads and never goes stale.
+// Every identity query asks GetIdentity afresh, but all of them share one connection: opening one
+// costs three round trips (authentication, Hello, the call), which a command-line tool pays at
+// every start-up. Queries may come from any thread, so the connection is held under a mutex; a
+// connection that broke (the bus restarted, or the process forked) is replaced and the query
+// asked once more, so a stale connection never reads as "no baseband".
 #include <dirent.h>
+#include <fcntl.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdint>
-#include <fstream>
 #include <limits>
+#include <mutex>
 #include <string>
 #include <string_view>
 
@@ -26,22 +30,51 @@ constexpr std::size_t kCommLength = 15;
 // Longest process name worth looking for; argv[0] is read no further than this.
 constexpr std::size_t kMaxProcessName = 4096;
 
-// The identity as the device reported it; empty when it could not be asked.
+class IdentitySource {
+ public:
+  // The identity as the device reported it; empty when it could not be asked.
+  MessageDict fetch() {
+    std::lock_guard lock(mutex_);
+    bus::MessagePtr reply;
+    bool reopened = false;
+    Result result = call(reopened, reply);
+    if (!result.ok() && !reopened && !isOpen()) {
+      result = call(reopened, reply);
+    }
+    MessageDict identity;
+    if (!result.ok() || sd_bus_message_has_signature(reply.get(), "a{sv}") <= 0 ||
+        bus::readDict(reply.get(), identity) < 0) {
+      return {};
+    }
+    return identity;
+  }
+
+ private:
+  bool isOpen() const { return bus_ && sd_bus_is_open(bus_.get()) > 0; }
+
+  Result call(bool& reopened, bus::MessagePtr& reply) {
+    if (!isOpen()) {
+      bus_.reset();
+      reopened = true;
+      sd_bus* opened = nullptr;
+      int r = sd_bus_open_system(&opened);
+      if (r < 0) {
+        return bus::resultFromOpenFailure(r);
+      }
+      bus_.reset(opened);
+    }
+    return bus::callSync(bus_.get(), bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface,
+                         "GetIdentity", nullptr, reply);
+  }
+
+  std::mutex mutex_;
+  bus::BusPtr bus_;
+};
+
 MessageDict fetchIdentity() {
-  sd_bus* opened = nullptr;
-  if (sd_bus_open_system(&opened) < 0) {
-    return {};
-  }
-  bus::BusPtr connection(opened);
-  bus::MessagePtr reply;
-  Result result = bus::callSync(connection.get(), bus::kDeviceName, bus::kDevicePath,
-                                bus::kDeviceInterface, "GetIdentity", nullptr, reply);
-  MessageDict identity;
-  if (!result.ok() || sd_bus_message_has_signature(reply.get(), "a{sv}") <= 0 ||
-      bus::readDict(reply.get(), identity) < 0) {
-    return {};
-  }
-  return identity;
+  // Never destroyed: a query may still come from another thread while the process exits.
+  static IdentitySource* const source = new IdentitySource;
+  return source->fetch();
 }
 
 int identityNumber(const char* key) {
@@ -62,16 +95,33 @@ bool identityFlag(const char* key) {
   return flag != nullptr && *flag;
 }
 
-// The first line of a small /proc file, or nothing when the process is gone.
-bool readFirstField(const std::string& path, char terminator, std::string& out) {
-  std::ifstream file(path, std::ios::binary);
-  if (!file) {
+// The first field of a small file under /proc (procFd), at most kMaxProcessName + 1 bytes of it,
+// or nothing when the process is gone. Plain reads relative to the open directory: a scan opens
+// one of these per process on the host.
+bool readFirstField(int procFd, const std::string& path, char terminator, std::string& out) {
+  const int fd = openat(procFd, path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) {
     return false;
   }
   out.clear();
-  char c = 0;
-  while (out.size() <= kMaxProcessName && file.get(c) && c != terminator) {
-    out.push_back(c);
+  char buffer[512];
+  bool done = false;
+  while (!done && out.size() <= kMaxProcessName) {
+    const ssize_t n = read(fd, buffer, sizeof buffer);
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n <= 0) {
+      break;
+    }
+    std::string_view chunk(buffer, static_cast<std::size_t>(n));
+    const std::size_t end = chunk.find(terminator);
+    done = end != std::string_view::npos;
+    out.append(chunk.substr(0, done ? end : chunk.size()));
+  }
+  close(fd);
+  if (out.size() > kMaxProcessName + 1) {
+    out.resize(kMaxProcessName + 1);
   }
   return true;
 }
@@ -81,9 +131,9 @@ std::string_view baseName(std::string_view path) {
   return slash == std::string_view::npos ? path : path.substr(slash + 1);
 }
 
-bool processHasName(const std::string& pid, const std::string& name) {
+bool processHasName(int procFd, const std::string& pid, const std::string& name) {
   std::string comm;
-  if (!readFirstField("/proc/" + pid + "/comm", '\n', comm)) {
+  if (!readFirstField(procFd, pid + "/comm", '\n', comm)) {
     return false;
   }
   if (name.size() < kCommLength) {
@@ -95,7 +145,7 @@ bool processHasName(const std::string& pid, const std::string& name) {
     return false;
   }
   std::string argv0;
-  return readFirstField("/proc/" + pid + "/cmdline", '\0', argv0) && baseName(argv0) == name;
+  return readFirstField(procFd, pid + "/cmdline", '\0', argv0) && baseName(argv0) == name;
 }
 
 }  // namespace
@@ -148,7 +198,7 @@ bool isProcessRunning(const std::string& name) {
     if (pid.empty() || pid.find_first_not_of("0123456789") != std::string_view::npos) {
       continue;
     }
-    found = processHasName(std::string(pid), name);
+    found = processHasName(dirfd(proc), std::string(pid), name);
   }
   closedir(proc);
   return found;

@@ -6,6 +6,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <memory>
 #include <thread>
 
 #include "platform/DevicePropertyService.h"
@@ -45,6 +46,21 @@ TEST(DeviceIdentityTest, FollowsTheDeviceServiceAndReadsEmptyWithoutIt) {
   }
   bus.stop();
   EXPECT_EQ(askDevice(), none);
+}
+
+// Queries share a connection; one to a bus that has since gone must not answer "no baseband"
+// when a bus with the device is there to ask.
+TEST(DeviceIdentityTest, AnswersFromANewBusAfterTheOldOneWentAway) {
+  auto first = std::make_unique<PrivateBus>();
+  {
+    SimProcess sim(*first, R"({"device": {"radio_type": 3}})");
+    ASSERT_EQ(device::getRadioType(), 3);
+  }
+  first.reset();
+  PrivateBus second;
+  SimProcess sim(second, R"({"device": {"radio_type": 5, "product_type": 12}})");
+  EXPECT_EQ(device::getRadioType(), 5);
+  EXPECT_EQ(device::getProductType(), 12);
 }
 
 TEST(HelperClientTest, PerformRunsTheCommandInTheService) {

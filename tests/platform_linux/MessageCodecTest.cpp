@@ -111,7 +111,7 @@ TEST_F(CodecTest, WireSignaturesFollowTheMapping) {
 TEST_F(CodecTest, UnsendableValuesAreRejectedBeforeAnythingIsAppended) {
   MessageDict tooWide;
   for (std::size_t i = 0; i <= kMaxDictEntries; ++i) {
-    tooWide.set("k" + std::to_string(i), MessageValue());
+    tooWide.set(std::string("k").append(std::to_string(i)), MessageValue());
   }
   const std::string withNul("a\0b", 3);
   const struct {

@@ -38,7 +38,11 @@ class ManagerTest : public ::testing::Test {
 
   void listen(const std::string& event) {
     client::RegisterEventHandler(manager_, event, [this, event](MessageValue payload, TaskGroup) {
-      mail_.add({event, {}, std::move(payload), queue_->isCurrent()});
+      Delivery delivery;
+      delivery.name = event;
+      delivery.value = std::move(payload);
+      delivery.onQueue = queue_->isCurrent();
+      mail_.add(std::move(delivery));
     });
   }
 

@@ -42,9 +42,11 @@ std::string Timestamp::asString(TimeDomain domain, Format format) const {
     // sorting and parsing the same way. Only the date forms pad.
     std::string text = std::to_string(static_cast<long long>(time.tv_sec));
     if ((format & kFormatMicroseconds) != 0) {
-      text += "." + std::to_string(static_cast<long long>(time.tv_usec));
+      text += '.';
+      text += std::to_string(static_cast<long long>(time.tv_usec));
     } else if ((format & kFormatMilliseconds) != 0) {
-      text += "." + std::to_string(milliseconds);
+      text += '.';
+      text += std::to_string(milliseconds);
     }
     return text;
   }

@@ -8,6 +8,7 @@
 #include <condition_variable>
 #include <cstdio>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -79,25 +80,33 @@ void BM_SyncPerform(benchmark::State& state) {
 void BM_AsyncPerform(benchmark::State& state) {
   auto manager = client::CreateManager("bench", WorkQueue::create("bench.queue"));
   const MessageDict request = sampleRequest();
-  std::mutex mutex;
-  std::condition_variable done;
-  bool finished = false;
-  Result last;
+  // Shared with the completion, which may still be notifying when the last iteration's wait ends.
+  struct Handoff {
+    std::mutex mutex;
+    std::condition_variable done;
+    bool finished = false;
+    Result last;
+  };
+  auto handoff = std::make_shared<Handoff>();
   for (auto _ : state) {
-    finished = false;
+    handoff->finished = false;
     client::PerformCommand(
         manager, kCommand,
-        [&](Result result, MessageValue) {
-          std::lock_guard lock(mutex);
-          last = std::move(result);
-          finished = true;
-          done.notify_one();
+        [handoff](Result result, MessageValue) {
+          {
+            std::lock_guard lock(handoff->mutex);
+            handoff->last = std::move(result);
+            handoff->finished = true;
+          }
+          // Outside the lock, so the woken thread does not block on it again: the harness's own
+          // hand-off should cost as little as it can.
+          handoff->done.notify_one();
         },
         request);
-    std::unique_lock lock(mutex);
-    done.wait(lock, [&] { return finished; });
-    if (!last.ok()) {
-      state.SkipWithError(last.message.c_str());
+    std::unique_lock lock(handoff->mutex);
+    handoff->done.wait(lock, [&] { return handoff->finished; });
+    if (!handoff->last.ok()) {
+      state.SkipWithError(handoff->last.message.c_str());
       return;
     }
   }

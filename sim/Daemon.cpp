@@ -76,6 +76,16 @@ int guarded(sd_bus_error* error, Body body) noexcept {
   }
 }
 
+// Reads the request dictionary that ends every Perform method; a value outside the message types
+// is the caller's mistake and answered as such.
+int readRequest(sd_bus_message* call, sd_bus_error* error, MessageDict& request) {
+  if (bus::readDict(call, request) < 0) {
+    return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
+                            "the request holds a value outside the message types");
+  }
+  return 0;
+}
+
 MessagePtr keep(sd_bus_message* message) {
   return MessagePtr(sd_bus_message_ref(message));
 }
@@ -538,10 +548,8 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
     if (r < 0)
       return r;
     MessageDict request;
-    if (bus::readDict(call, request) < 0) {
-      return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
-                              "the request holds a value outside the message types");
-    }
+    if (r = readRequest(call, error, request); r < 0)
+      return r;
     impl->log.write({{"service", "server"},
                      {"method", "PerformCommand"},
                      {"client", client},
@@ -635,10 +643,8 @@ int Daemon::Impl::onHelperPerform(sd_bus_message* call, void* userdata, sd_bus_e
     if (r < 0)
       return r;
     MessageDict request;
-    if (bus::readDict(call, request) < 0) {
-      return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
-                              "the request holds a value outside the message types");
-    }
+    if (r = readRequest(call, error, request); r < 0)
+      return r;
     impl->log.write({{"service", "helper"},
                      {"method", "Perform"},
                      {"client", service},

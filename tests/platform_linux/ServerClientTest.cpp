@@ -294,6 +294,22 @@ TEST_F(ManagerTest, LosingOurConnectionCompletesPendingCalls) {
   EXPECT_EQ(states(), (std::vector<std::string>{kServerStateStarted, "Stopped"}));
 }
 
+// Nothing but the manager's own retries brings it back: no command is sent after the restart.
+TEST_F(ManagerTest, EventsResumeByThemselvesAfterTheBusRestarts) {
+  start("{}");
+  listen(kEventServerStateChange);
+  client::EventsOn(manager_);
+  ASSERT_TRUE(mail_.waitFor(1, kEventServerStateChange));
+  bus_.restart();
+  ASSERT_TRUE(mail_.waitFor(2, kEventServerStateChange));
+  sim_.reset();  // it ended with the old bus
+  sim_.emplace(bus_, "{}");
+  ASSERT_TRUE(mail_.waitFor(3, kEventServerStateChange));
+  ASSERT_TRUE(drain(*queue_));
+  EXPECT_EQ(states(),
+            (std::vector<std::string>{kServerStateStarted, "Stopped", kServerStateStarted}));
+}
+
 TEST_F(ManagerTest, DestroyingAManagerCompletesWhatIsPending) {
   start(R"({"server": {"commands": {"Slow": {"fault": "never_answer"}}}})");
   client::PerformCommand(manager_, "Slow", record("dropped"), {});

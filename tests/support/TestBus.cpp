@@ -133,23 +133,42 @@ TempDir::~TempDir() {
 }
 
 PrivateBus::PrivateBus() {
+  writeFile(dir_.path() / "bus.conf", kBusConfig);
+  launch({});
+  // Without the daemon's guid, so that a restarted daemon at the same socket is the same bus to
+  // a client reconnecting through the variable.
+  address_ = address_.substr(0, address_.find(",guid="));
+  ::setenv("DBUS_SYSTEM_BUS_ADDRESS", address_.c_str(), 1);
+}
+
+void PrivateBus::launch(const std::string& listenAddress) {
   const auto config = dir_.path() / "bus.conf";
-  writeFile(config, kBusConfig);
+  std::vector<std::string> args = {"/usr/bin/dbus-daemon", "--config-file=" + config.string(),
+                                   "--nofork", "--print-address=3"};
+  if (!listenAddress.empty()) {
+    args.push_back("--address=" + listenAddress);
+  }
   Pipe address;
   const int devNull = ::open("/dev/null", O_WRONLY | O_CLOEXEC);
   // dbus-daemon complains on stderr that it cannot raise its fd limit in a container; harmless,
   // so its stderr goes nowhere.
-  pid_ = spawnChild(
-      {"/usr/bin/dbus-daemon", "--config-file=" + config.string(), "--nofork", "--print-address=3"},
-      {}, {{address.fds[1], 3}, {devNull, 2}});
+  pid_ = spawnChild(args, {}, {{address.fds[1], 3}, {devNull, 2}});
   ::close(devNull);
   address.closeWriteEnd();
-  if (!readLine(address.fds[0], address_, Clock::now() + std::chrono::seconds(10)) ||
-      address_.empty()) {
+  std::string printed;
+  if (!readLine(address.fds[0], printed, Clock::now() + std::chrono::seconds(10)) ||
+      printed.empty()) {
     const ExitStatus status = waitChild(std::exchange(pid_, -1), milliseconds(0));
     throw std::runtime_error("dbus-daemon did not print its address (" + status.describe() + ")");
   }
-  ::setenv("DBUS_SYSTEM_BUS_ADDRESS", address_.c_str(), 1);
+  if (listenAddress.empty()) {
+    address_ = printed;
+  }
+}
+
+void PrivateBus::restart() {
+  stop();
+  launch(address_);
 }
 
 PrivateBus::~PrivateBus() {

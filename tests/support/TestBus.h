@@ -58,10 +58,16 @@ class PrivateBus {
   // Kills the daemon now, for tests of a bus that goes away.
   void stop();
 
+  // Kills the daemon and starts a new one at the same address: the bus restarted, with every
+  // connection and name lost.
+  void restart();
+
   // Runs `busctl --address=ADDRESS args...`, for example {"--json=short", "call", ...}.
   RunResult busctl(const std::vector<std::string>& args) const;
 
  private:
+  void launch(const std::string& listenAddress);
+
   TempDir dir_;
   pid_t pid_ = -1;
   std::string address_;

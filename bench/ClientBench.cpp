@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Latency of one command through the client framework against a bare sd_bus_call of the same
 // method on the same bus. Needs DBUS_SYSTEM_BUS_ADDRESS and a running halvex-sim; see
 // run-client-bench.sh. After the runs it prints how much each framework path costs relative to

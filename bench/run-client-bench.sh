@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: MIT
 # Measures the client framework against a bare sd_bus_call: builds the benchmark and the
 # simulator (optimised, in build/bench unless BUILD_DIR says otherwise), starts a private bus with
 # the simulated device and runs the benchmark. Extra arguments go to the benchmark, for example

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: MIT
 # Start-up cost of halvextool: times one-shot `halvextool logdump tel` against the simulated
 # device and reports how far the median run lies above the tool's 500 ms wait for the server's
 # state (target: under 10 ms), and the peak resident memory of a run.

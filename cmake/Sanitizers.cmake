@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: MIT
 if(HALVEX_SANITIZER STREQUAL "asan")
   add_compile_options(-fsanitize=address,undefined -fno-omit-frame-pointer -fno-sanitize-recover=all)
   add_link_options(-fsanitize=address,undefined)

@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: MIT
 # Project code builds warning-free; third-party headers come in as SYSTEM and stay out of it.
 function(halvex_warnings target)
   target_compile_options(${target} PRIVATE

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The device-property service: named properties of the device (such as "boot-args").
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Questions about the device the program runs on. Each call asks afresh; nothing is cached
 // here. All functions may be called from any thread and never fail: a device that cannot answer
 // reads as having no radio (type 0), vendor and product 0, and every build flag false.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The helper-client framework: synchronous requests to small helper services that keep working
 // while the server is down. One source file per backend defines the implementation.
 #pragma once

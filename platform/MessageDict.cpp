@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Portable: standard library only.
 #include "platform/MessageDict.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Inter-process message dictionaries: the values that requests, replies and event payloads are
 // made of. Portable code: standard library only.
 //

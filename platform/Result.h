@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The outcome of a request to the server or to a helper service.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The main thread's run loop.
 #pragma once
 

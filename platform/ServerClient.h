@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The baseband-manager server's client framework.
 //
 // A Manager is one client's connection to the server. Every callback of a manager (event

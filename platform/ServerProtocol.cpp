@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "platform/ServerProtocol.h"
 
 namespace halvex {

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Names of the baseband-manager server's protocol and of the log-dump helper service: commands,
 // events, keys and values. Each value is defined once, in ServerProtocol.cpp; the simulator and
 // the tool both use these definitions.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The system log: a context names where messages come from (a reverse-domain subsystem and a
 // category); a server writes them; a logger binds a context to a server.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // A reference-counted completion group. Portable code: standard library only.
 //
 // A group counts outstanding work: enter() adds one, leave() takes one away, and wait() blocks

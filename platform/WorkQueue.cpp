@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Portable: standard library only, apart from naming the thread where the C library can.
 #include "platform/WorkQueue.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // A serial work queue. Portable code: standard library only.
 //
 // A WorkQueue runs the closures posted to it one at a time, in the order they were posted, on a

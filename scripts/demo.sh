@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: MIT
 # Runs halvextool against the built-in simulated device on a fresh Debian 12 machine: installs
 # what is missing, builds the tool and the simulator, starts a private bus with a working device
 # (server started, baseband logs enabled), then runs the tool. With no arguments the tool is

@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: MIT
 # Starts a private system bus and the simulated device for the scripts that source this file.
 # After start_simulated_device SCENARIO LOG_ROOT REQUEST_LOG: DBUS_SYSTEM_BUS_ADDRESS points at the
 # private bus, and stop_simulated_device (run on exit) ends both.

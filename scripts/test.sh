@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: MIT
 # The whole test suite on a fresh Debian 12 machine: installs what is missing, then configures,
 # builds and runs every test under the plain, AddressSanitizer+UBSan and ThreadSanitizer presets.
 # Arguments, if any, name the presets to run instead of all three.

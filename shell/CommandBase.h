@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // A node of the command tree the shell walks: a named command with options (actions) and
 // sub-commands (children).
 //

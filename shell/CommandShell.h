@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // A line-oriented shell over a tree of CommandBase commands.
 //
 // run() either evaluates its arguments once (one-shot mode) or, when there are none after the

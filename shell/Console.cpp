@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "shell/Console.h"
 
 #include <atomic>

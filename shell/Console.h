@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The process's standard streams, reached through one place so that tests can swap them.
 //
 // Everything the tool prints or reads goes through consoleIn(), consoleOut() and consoleErr()

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The simulator's bus side: the server, the helper, the device identity and the control
 // interface, each on its own connection to the system bus, all served by one sd_event loop on
 // the main thread. Nothing here blocks that loop: a delayed or never-answered request keeps its

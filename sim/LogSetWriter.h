@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Writes, under a root folder standing in for the device's file system, the logs a successful
 // collection would leave, at exactly the path the tool prints for it, so that a person following
 // "Path = ..." finds real files. Only the simulator calls this; nothing reads the files back.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "sim/ProcessKeeper.h"
 
 #include <fcntl.h>

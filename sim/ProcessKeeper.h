@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Keeps named processes running for as long as the simulator runs, so that a check of the
 // process table (comm, and argv[0] for names of 15 bytes or more) finds them. Each is /bin/sleep
 // started through a symbolic link named NAME: the kernel takes comm from the link's name, and

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "sim/RequestLog.h"
 
 #include <fcntl.h>

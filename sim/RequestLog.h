@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The request log: one JSON object a line for every request the simulator receives, written and
 // flushed as the request arrives, so a test can read it while the simulator runs and nothing is
 // lost when a fault makes the simulator exit.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "sim/Scenario.h"
 
 #include <fstream>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The simulator's scenario: what the device, the server and the helper say, read from JSON and
 // checked up front so that the daemon never meets a value it cannot use. See docs/simulator.md
 // for the format. No bus here; tests feed JSON text directly.

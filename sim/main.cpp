@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // halvex-sim: the simulated device, baseband-manager server and log-dump helper on the system
 // bus, driven by a scenario file. See docs/simulator.md.
 #include <fcntl.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The words that follow a log-dump option, and the text of trace property values.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "Tools/HalvexTool/HalvexCommand.h"
 
 #include <utility>

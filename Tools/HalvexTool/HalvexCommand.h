@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The root of the tool's command tree, named after the running program. It talks to nobody; it
 // only holds the "logdump" command.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The base of every command that talks to the server: a command that also carries the tool's
 // one connection to the server and the queue its callbacks arrive on.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Compiled twice; see HalvexShell.h.
 #include "Tools/HalvexTool/HalvexShell.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The tool's shell and its process entry.
 //
 // HalvexShell.cpp is compiled twice: into the halvex_tool library without HALVEX_TOOL_MAIN,

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The three log collections behind "logdump tel", "logdump core" and "logdump bb", the queries
 // they make first, and the lines that report where the logs went.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // "logdump": the log collections "tel", "core" and "bb".
 #pragma once
 

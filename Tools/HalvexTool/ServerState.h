@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Whether the server has started, as its latest state event says. Written on the client
 // framework's queue, read on the shell thread.
 #pragma once

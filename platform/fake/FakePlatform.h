@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // In-process test doubles of every platform service: the device queries, the device-property
 // service, the system log, the server's client framework and the helper client.
 //

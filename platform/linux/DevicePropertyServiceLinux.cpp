@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Device properties on a Linux host: the kernel's command line stands for the boot arguments.
 #include <fstream>
 #include <iterator>

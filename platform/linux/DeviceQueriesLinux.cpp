@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Device queries on a Linux host: the identity comes from org.halvex.Device over the system bus,
 // processes from /proc.
 //

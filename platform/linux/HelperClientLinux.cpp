@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The helper-client framework over D-Bus: org.halvex.Helper1.Perform, synchronously.
 //
 // Each client opens its own connection at its first request and keeps it, reopening it when it

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Encoding of messages on the bus, shared by the host backend and the simulator.
 // See docs/dbus-protocol.md for the mapping. These functions touch only the message they are
 // given, so they run on whichever thread owns that message's bus.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The server's client framework over D-Bus (see docs/dbus-protocol.md).
 //
 // Each Manager runs one BusThread: a private connection and its event loop on an I/O thread of

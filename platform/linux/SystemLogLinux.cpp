@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The system log on a Linux host is the journal. Without a journal (containers, test machines)
 // every write is dropped silently: logging must never be the reason a request fails.
 #include <sys/uio.h>

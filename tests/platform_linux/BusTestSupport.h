@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Waiting helpers for the backend tests: everything the backend delivers arrives on other
 // threads, so tests collect it here and wait with a failsafe time-out.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Device queries, the helper client and the host's own facts (processes, boot arguments).
 #include <gtest/gtest.h>
 #include <signal.h>

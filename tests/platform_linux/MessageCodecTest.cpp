@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The codec against real sd-bus messages, without a bus daemon.
 #include <gtest/gtest.h>
 #include <sys/socket.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The server's client framework against halvex-sim on a private bus.
 #include <gtest/gtest.h>
 #include <systemd/sd-bus.h>

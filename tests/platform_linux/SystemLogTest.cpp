@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The system log speaks the journal's native protocol. Where no journal runs (containers, CI),
 // the test plays the journal: it binds the socket the journal would and reads the datagram.
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Command trees built in test code, and a runner that drives a shell through string streams.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // What the simulator writes for a person to find from the tool's "Path = ..." line, and the
 // request log's form of a request.
 #include <gtest/gtest.h>

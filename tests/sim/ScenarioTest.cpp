@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Scenario parsing without a bus: defaults, overrides, and a precise place for every mistake.
 #include <gtest/gtest.h>
 

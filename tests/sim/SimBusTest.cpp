@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // halvex-sim on a private bus, seen from a plain sd-bus client: it answers as its scenario says,
 // logs what it receives, and fails in the ways it is asked to.
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The fixtures the bus and end-to-end tests stand on: if these lie, every test above them does.
 #include <gtest/gtest.h>
 

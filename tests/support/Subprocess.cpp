@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "tests/support/Subprocess.h"
 
 #include <fcntl.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Child processes for tests: start a program with chosen arguments and environment, feed its
 // standard input, collect its output and exit status, and never wait forever.
 //

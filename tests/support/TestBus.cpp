@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "tests/support/TestBus.h"
 
 #include <fcntl.h>

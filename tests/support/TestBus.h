@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Test fixtures for everything that talks over D-Bus: a private bus and the simulated device.
 //
 //   halvex::test::PrivateBus bus;                       // first thing in the test

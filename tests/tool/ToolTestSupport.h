@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Shared pieces of the tool's unit tests: captured console streams, a fake server script and a
 // "logdump" command wired to the fake platform.
 #pragma once

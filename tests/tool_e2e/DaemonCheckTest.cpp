@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Start-up against the real process table: the simulator keeps processes with the daemons'
 // names alive for as long as it runs.
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Running the real halvextool in the end-to-end tests.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Shared by the trace tests: each test starts from a device of its choosing and then reads the
 // platform calls that the code under test made.
 #pragma once

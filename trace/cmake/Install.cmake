@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: MIT
 # Installs the HalvexTrace package (component "HalvexTrace") for find_package(HalvexTrace):
 #   Halvex::trace          this library, exported
 #   Halvex::platform_core  the platform core it links, imported by HalvexTraceConfig.cmake

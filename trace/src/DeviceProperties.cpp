@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The device's named properties, read once through one shared DevicePropertyService. Kept apart
 // from the other identity queries so that only programs reading properties need the service.
 #include <map>

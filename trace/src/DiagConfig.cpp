@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "halvex/trace/DiagConfig.h"
 
 #include <cstddef>

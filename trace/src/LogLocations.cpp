@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "halvex/trace/LogLocations.h"
 
 #include "halvex/trace/DeviceIdentity.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The one check of what a D-Bus string may hold, shared by the codec and the name checks.
 #pragma once
 

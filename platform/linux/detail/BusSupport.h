@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // What every service of the host backend needs on the bus: the names of the protocol, the
 // mapping of bus failures to Result codes, owning pointers and a blocking call for the services
 // that are synchronous by contract. Nothing here keeps state between calls.

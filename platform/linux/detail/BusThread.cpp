@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 #include "platform/linux/detail/BusThread.h"
 
 #include <pthread.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // One I/O thread that owns an sd_event loop and one private connection to the system bus.
 //
 // sd-bus objects are not thread-safe and messages pin their connection with a plain reference

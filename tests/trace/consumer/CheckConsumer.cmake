@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: MIT
 # cmake -P script: installs the HalvexTrace component of BUILD_DIR into a scratch prefix under
 # WORK_DIR, builds the consumer project in CONSUMER_DIR against it and runs the result.
 # Also takes CONFIG, GENERATOR, CXX_COMPILER and LINK_FLAGS from the calling build.

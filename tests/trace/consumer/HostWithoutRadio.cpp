@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // A minimal platform backend: a host with no baseband radio, no build flags, no trace
 // permission and no device properties. It defines what the trace library calls.
 #include <map>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The trace library's view of the device: radio, vendor, product, build type, boot arguments,
 // and the system-log context the library logs under.
 //

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Names and defaults of the baseband's diagnostic ("DIAG") logging settings. Only the names are
 // published here; where the settings are stored and who reads them is up to their users.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // Where baseband and telephony logs live on the device and how their folders and files are
 // named. Every folder path is absolute and ends with "/". The two scratch-folder names that lie
 // inside kScratchFolder are diag::config::kDIAGScratchDir and kADPLScratchDir (DiagConfig.h).

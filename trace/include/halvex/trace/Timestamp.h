@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // One moment as seen in several time domains, rendered as text for log and file names.
 //
 // A plain value: copies are deep and independent. No internal locking: concurrent const calls on

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: MIT
 // The catalogue of trace names and the rules that decide which traces this device supports.
 //
 // Trace names are matched ignoring ASCII letter case; the constants hold their canonical forms.

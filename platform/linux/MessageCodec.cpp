@@ -301,8 +301,10 @@ bool isBusString(std::string_view text) {
       }
       point = (point << 6) | (next & 0x3Fu);
     }
-    // Overlong forms, UTF-16 surrogates and points beyond Unicode are not UTF-8.
-    if (point < lowest || (point >= 0xD800 && point <= 0xDFFF) || point > 0x10FFFF) {
+    // Overlong forms, UTF-16 surrogates and points beyond Unicode are not UTF-8; sd-bus also
+    // refuses the noncharacters (U+FDD0 to U+FDEF, and the last two points of every plane).
+    if (point < lowest || (point >= 0xD800 && point <= 0xDFFF) || point > 0x10FFFF ||
+        (point >= 0xFDD0 && point <= 0xFDEF) || (point & 0xFFFEu) == 0xFFFEu) {
       return false;
     }
     i += length;

@@ -4,8 +4,9 @@
 
 namespace halvex::platform {
 
-// Serves the main thread's platform events. Nothing in the program stops it; the process ends by
-// exit() from another thread. Returns only if the backend's loop itself fails.
+// Serves the platform's I/O on the calling thread (on a Linux host, the process's bus
+// connection); no work of the program's own runs there. It does not return: the process ends by
+// exit() from another thread.
 void runMainLoop();
 
 }  // namespace halvex::platform

@@ -22,7 +22,7 @@ class LogContext {
   std::string category_;
 };
 
-enum class LogLevel { kDebug, kInfo, kNotice, kError };
+enum class LogLevel { kDebug, kInfo, kNotice, kWarning, kError };
 
 class LogServer {
  public:

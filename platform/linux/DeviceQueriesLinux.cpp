@@ -2,11 +2,10 @@
 // Device queries on a Linux host: the identity comes from org.halvex.Device over the system bus,
 // processes from /proc.
 //
-// Every identity query asks GetIdentity afresh, but all of them share one connection: opening one
-// costs three round trips (authentication, Hello, the call), which a command-line tool pays at
-// every start-up. Queries may come from any thread, so the connection is held under a mutex; a
-// connection that broke (the bus restarted, or the process forked) is replaced and the query
-// asked once more, so a stale connection never reads as "no baseband".
+// A device's radio, vendor, product and build types do not change while a process runs, so the
+// identity is asked once and kept. Only an answer is kept: when no device service runs, or the
+// question fails, it is asked again next time, so a passing fault never reads as "no baseband"
+// for the rest of the process.
 #include <dirent.h>
 #include <fcntl.h>
 #include <unistd.h>
@@ -15,12 +14,15 @@
 #include <cstdint>
 #include <limits>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 
 #include "platform/DeviceQueries.h"
 #include "platform/linux/MessageCodec.h"
 #include "platform/linux/detail/BusSupport.h"
+#include "platform/linux/detail/CallBounds.h"
+#include "platform/linux/detail/ProcessBus.h"
 
 namespace halvex::device {
 
@@ -31,55 +33,42 @@ constexpr std::size_t kCommLength = 15;
 // Longest process name worth looking for; argv[0] is read no further than this.
 constexpr std::size_t kMaxProcessName = 4096;
 
-class IdentitySource {
- public:
-  // The identity as the device reported it; empty when it could not be asked.
-  MessageDict fetch() {
-    std::lock_guard lock(mutex_);
-    bus::MessagePtr reply;
-    bool reopened = false;
-    Result result = call(reopened, reply);
-    if (!result.ok() && !reopened && !isOpen()) {
-      result = call(reopened, reply);
-    }
-    MessageDict identity;
-    if (!result.ok() || sd_bus_message_has_signature(reply.get(), "a{sv}") <= 0 ||
-        bus::readDict(reply.get(), identity) < 0) {
-      return {};
-    }
-    return identity;
-  }
-
- private:
-  bool isOpen() const { return bus_ && sd_bus_is_open(bus_.get()) > 0; }
-
-  Result call(bool& reopened, bus::MessagePtr& reply) {
-    if (!isOpen()) {
-      bus_.reset();
-      reopened = true;
-      sd_bus* opened = nullptr;
-      int r = sd_bus_open_system(&opened);
-      if (r < 0) {
-        return bus::resultFromOpenFailure(r);
-      }
-      bus_.reset(opened);
-    }
-    return bus::callSync(bus_.get(), bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface,
-                         "GetIdentity", nullptr, reply);
-  }
-
-  std::mutex mutex_;
-  bus::BusPtr bus_;
-};
-
 MessageDict fetchIdentity() {
-  // Never destroyed: a query may still come from another thread while the process exits.
-  static IdentitySource* const source = new IdentitySource;
-  return source->fetch();
+  // Held across the first query, so that concurrent first callers make one query between them.
+  static std::mutex mutex;
+  static std::optional<MessageDict> kept;
+  std::lock_guard lock(mutex);
+  if (kept) {
+    return *kept;
+  }
+  MessageDict identity;
+  const auto ask = [&identity] {
+    return bus::ProcessBus::instance().call(
+        {bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, "GetIdentity",
+         bus::callBounds().identity, "device", "GetIdentity"},
+        nullptr, [&identity](sd_bus_message* reply) {
+          if (sd_bus_message_has_signature(reply, "a{sv}") <= 0 ||
+              bus::readDict(reply, identity) < 0) {
+            identity = {};
+            return bus::makeResult(kResultBadReply, "identity of the wrong shape");
+          }
+          return Result{};
+        });
+  };
+  Result result = ask();
+  // A connection that went stale while nobody served it (the bus restarted before the run loop
+  // started) only shows when used; the question is harmless to ask again on a fresh one.
+  if (result.code == kResultConnectionLost) {
+    result = ask();
+  }
+  if (result.ok()) {
+    kept = identity;
+  }
+  return identity;
 }
 
 int identityNumber(const char* key) {
-  MessageDict identity = fetchIdentity();
+  const MessageDict identity = fetchIdentity();
   const MessageValue* value = identity.get(key);
   const std::int64_t* number = value ? value->asInt64() : nullptr;
   if (number == nullptr || *number < std::numeric_limits<int>::min() ||
@@ -90,7 +79,7 @@ int identityNumber(const char* key) {
 }
 
 bool identityFlag(const char* key) {
-  MessageDict identity = fetchIdentity();
+  const MessageDict identity = fetchIdentity();
   const MessageValue* value = identity.get(key);
   const bool* flag = value ? value->asBool() : nullptr;
   return flag != nullptr && *flag;

@@ -1,16 +1,14 @@
 // SPDX-License-Identifier: MIT
-// The helper-client framework over D-Bus: org.halvex.Helper1.Perform, synchronously.
-//
-// Each client opens its own connection at its first request and keeps it, reopening it when it
-// broke. A client is used by one thread at a time, so the blocking sd_bus_call is enough; the
-// mutex only keeps a caller that breaks that rule from corrupting the connection.
-#include <mutex>
+// The helper-client framework over D-Bus: org.halvex.Helper1.Perform, synchronously, on the
+// process's one connection (detail/ProcessBus.h).
 #include <string>
 #include <string_view>
 
 #include "platform/HelperClient.h"
 #include "platform/linux/MessageCodec.h"
 #include "platform/linux/detail/BusSupport.h"
+#include "platform/linux/detail/CallBounds.h"
+#include "platform/linux/detail/ProcessBus.h"
 
 namespace halvex {
 
@@ -38,58 +36,35 @@ class LinuxHelperClient final : public HelperClient {
  public:
   LinuxHelperClient(std::string service, std::shared_ptr<LogServer> logger)
       : service_(std::move(service)),
-        log_(LogContext("org.halvex.platform", "helper"), std::move(logger)) {}
+        log_(LogContext(bus::kLogSubsystem, "helper"), std::move(logger)) {}
 
   Result perform(helper::TaskID task, const char* command, MessageDict request,
                  MessageValue& reply) override {
-    std::lock_guard lock(mutex_);
-    Result result = call(task, command, request, reply);
-    if (!result.ok()) {
-      log_.log(LogLevel::kError,
-               service_ + " " + (command ? command : "(null)") + " failed: " + result.message);
-    }
-    return result;
-  }
-
- private:
-  Result call(helper::TaskID task, const char* command, const MessageDict& request,
-              MessageValue& reply) {
     if (command == nullptr || !bus::isSendableName(command)) {
       return bus::makeResult(kResultInvalidRequest, "command name cannot be sent");
     }
-    if (!bus_ || sd_bus_is_open(bus_.get()) <= 0) {
-      bus_.reset();
-      sd_bus* opened = nullptr;
-      int r = sd_bus_open_system(&opened);
-      if (r < 0) {
-        return bus::resultFromOpenFailure(r);
-      }
-      bus_.reset(opened);
-    }
-    bus::MessagePtr answer;
-    Result result = bus::callSync(
-        bus_.get(), bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, "Perform",
+    MessageValue value;
+    const Result result = bus::ProcessBus::instance().call(
+        {bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, "Perform",
+         bus::callBounds().helper, "helper", "Perform " + service_ + " " + command},
         [&](sd_bus_message* message) {
           int r = sd_bus_message_append(message, "sis", service_.c_str(),
                                         static_cast<std::int32_t>(task), command);
           return r < 0 ? r : bus::appendDict(message, request);
         },
-        answer);
-    if (!result.ok()) {
-      return result;
-    }
-    MessageValue value;
-    result = bus::readOutcome(answer.get(), value);
+        [&value](sd_bus_message* answer) { return bus::readOutcome(answer, value); });
     if (result.ok()) {
       reply = std::move(value);
+    } else {
+      // The platform's own log has every request; a caller that gave a logger sees failures too.
+      log_.log(LogLevel::kError, service_ + " " + command + " failed: " + result.message);
     }
     return result;
   }
 
+ private:
   const std::string service_;
   const Logger log_;
-  std::mutex mutex_;
-  bus::BusPtr bus_;
 };
 
 }  // namespace

@@ -50,9 +50,6 @@ int checkValue(const MessageValue& value, int depth, Budget& budget) {
   if (!budget.take()) {
     return -E2BIG;
   }
-  if (const std::string* text = value.asString()) {
-    return isBusString(*text) ? 0 : -EINVAL;
-  }
   if (const MessageDict* dict = value.asDict()) {
     return checkDict(*dict, depth + 1, budget);
   }
@@ -60,6 +57,12 @@ int checkValue(const MessageValue& value, int depth, Budget& budget) {
 }
 
 int putVariant(sd_bus_message* message, const MessageValue& value);
+
+// The inside of a null variant; the caller closes the variant.
+int putNull(sd_bus_message* message) {
+  int r = sd_bus_message_open_container(message, 'v', "g");
+  return r < 0 ? r : sd_bus_message_append_basic(message, 'g', "");
+}
 
 int putDict(sd_bus_message* message, const MessageDict& dict) {
   int r = sd_bus_message_open_container(message, 'a', kEntryContainer);
@@ -91,12 +94,14 @@ int putVariant(sd_bus_message* message, const MessageValue& value) {
   int r = 0;
   switch (value.kind()) {
     case MessageValue::Kind::kNull:
-      r = sd_bus_message_open_container(message, 'v', "g");
-      if (r >= 0) {
-        r = sd_bus_message_append_basic(message, 'g', "");
-      }
+      r = putNull(message);
       break;
     case MessageValue::Kind::kString:
+      // A value that cannot be created on the bus travels as null, and the message still goes.
+      if (!isBusString(*value.asString())) {
+        r = putNull(message);
+        break;
+      }
       r = sd_bus_message_open_container(message, 'v', "s");
       if (r >= 0) {
         r = sd_bus_message_append_basic(message, 's', value.asString()->c_str());

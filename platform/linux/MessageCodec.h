@@ -4,7 +4,7 @@
 // given, so they run on whichever thread owns that message's bus.
 //
 // Encoding checks the whole value before it appends anything, so a value that cannot be sent
-// leaves the message as it was. Decoding stops at the first fault; the message's read position is
+// leaves the message as it was: never half-built. Decoding stops at the first fault; the message's read position is
 // then wherever the fault was found and the caller should treat the whole message as bad. Decoded
 // output is only complete when the call returns 0.
 #pragma once
@@ -26,9 +26,10 @@ inline constexpr int kMaxDictDepth = 16;
 inline constexpr std::size_t kMaxDictEntries = 1024;
 inline constexpr std::size_t kMaxValues = 16384;
 
-// Appends dict as "a{sv}". Returns 0, or a negative errno (-EINVAL for a string that is not
-// valid UTF-8 or holds a NUL byte, or nesting deeper than kMaxDictDepth; -E2BIG beyond the size
-// limits above).
+// Appends dict as "a{sv}". A string value the bus cannot carry (not UTF-8, a NUL byte, a
+// noncharacter) is sent as null instead, so a request is never lost to one bad value. Returns 0,
+// or a negative errno (-EINVAL for such a key, or nesting deeper than kMaxDictDepth; -E2BIG
+// beyond the size limits above).
 int appendDict(sd_bus_message* message, const MessageDict& dict);
 
 // Appends value as a variant "v"; null is a variant holding the empty signature. Errors as for

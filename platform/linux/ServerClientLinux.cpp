@@ -1,24 +1,24 @@
 // SPDX-License-Identifier: MIT
 // The server's client framework over D-Bus (see docs/dbus-protocol.md).
 //
-// Each Manager runs one BusThread: a private connection and its event loop on an I/O thread of
-// its own. The calling threads only queue work for it; it builds and sends the calls, decodes
-// replies and signals into plain values, and posts completions and events to the manager's
-// WorkQueue. A synchronous command is the same call with the caller waiting for the outcome,
-// which the I/O thread hands over directly, so waiting on the WorkQueue cannot deadlock.
+// Every Manager works on the process's one connection (detail/ProcessBus.h): the calling threads
+// hand their requests to the bus's I/O context, which builds and sends the calls, decodes replies
+// and signals into plain values, and posts completions and events to the manager's WorkQueue. A
+// synchronous command is the same call with the caller waiting for its outcome, which the I/O
+// context hands over directly, so waiting on the WorkQueue cannot deadlock.
 //
 // Destroying a Manager completes every command still pending with kResultConnectionLost (on the
-// queue, as always) and drops events not yet delivered; it closes the connection and ends the
-// I/O thread before it returns, unless the last reference went on the I/O thread itself.
+// queue, as always) and drops events not yet delivered, before the destructor returns.
 //
-// After our own connection breaks, a manager with events on delivers the stopped state and
-// tries to reconnect every second; any command also reconnects on demand.
+// When the connection breaks, a manager with events on delivers the stopped state and tries to
+// reconnect every second; any command also reconnects on demand.
 #include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <future>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -27,20 +27,22 @@
 #include "platform/ServerProtocol.h"
 #include "platform/linux/MessageCodec.h"
 #include "platform/linux/detail/BusSupport.h"
-#include "platform/linux/detail/BusThread.h"
+#include "platform/linux/detail/CallBounds.h"
+#include "platform/linux/detail/ProcessBus.h"
 
 namespace halvex::client {
 
 namespace {
 
-using bus::BusThread;
+using bus::ProcessBus;
 
 // Commands accepted but not yet completed, per manager. dbus-daemon refuses more than its own
 // limit of pending replies anyway; this one bounds what piles up on our side before that.
 constexpr std::size_t kMaxPendingCommands = 1024;
 // Events posted to the queue but not yet run; a flood beyond that is dropped.
 constexpr std::size_t kMaxUndeliveredEvents = 1024;
-// Events in one Subscribe reply.
+// Events taken from one Subscribe reply. Beyond it only the server's last state event is kept,
+// so that a server listing too much still gets its state across.
 constexpr std::size_t kMaxSubscribeEvents = 256;
 
 constexpr auto kReconnectDelay = std::chrono::seconds(1);
@@ -142,27 +144,83 @@ struct CommandCall {
   Done done;
 };
 
+struct SlotReleaser {
+  void operator()(sd_bus_slot* slot) const { sd_bus_slot_unref(slot); }
+};
+using SlotPtr = std::unique_ptr<sd_bus_slot, SlotReleaser>;
+
+bus::CallSpec commandSpec(const std::string& command) {
+  return {bus::kServerName,
+          bus::kServerPath,
+          bus::kServerInterface,
+          "PerformCommand",
+          bus::serverCommandBound(command),
+          "server",
+          "PerformCommand " + command};
+}
+
+// Reads a Subscribe reply "a(sv)". False for any other shape, or an entry outside the mapping.
+bool readEventList(sd_bus_message* reply,
+                   std::vector<std::pair<std::string, MessageValue>>& events) {
+  if (sd_bus_message_has_signature(reply, "a(sv)") <= 0 ||
+      sd_bus_message_enter_container(reply, 'a', "(sv)") <= 0) {
+    return false;
+  }
+  std::optional<MessageValue> lateState;
+  int r = 0;
+  while ((r = sd_bus_message_enter_container(reply, 'r', "sv")) > 0) {
+    const char* name = nullptr;
+    MessageValue payload;
+    if (sd_bus_message_read(reply, "s", &name) <= 0 || bus::readVariant(reply, payload) < 0 ||
+        sd_bus_message_exit_container(reply) < 0) {
+      return false;
+    }
+    if (events.size() < kMaxSubscribeEvents) {
+      events.emplace_back(name, std::move(payload));
+    } else if (std::string_view(name) == kEventServerStateChange) {
+      lateState = std::move(payload);
+    }
+  }
+  if (r < 0 || sd_bus_message_exit_container(reply) < 0) {
+    return false;
+  }
+  if (lateState) {
+    events.emplace_back(kEventServerStateChange, std::move(*lateState));
+  }
+  return true;
+}
+
 }  // namespace
 
-class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
+class ManagerCore : public std::enable_shared_from_this<ManagerCore>,
+                    public bus::ConnectionListener {
  public:
   ManagerCore(std::string client, WorkQueue queue)
       : client_(std::move(client)),
         clientSendable_(bus::isSendableName(client_)),
         queue_(std::move(queue)),
-        hub_(std::make_shared<EventHub>()),
-        thread_("halvex-client", BusThread::Hooks{[this](sd_bus* bus) { onConnected(bus); },
-                                                  [this] { onDisconnected(); }}) {}
+        hub_(std::make_shared<EventHub>()) {}
 
-  void start() { thread_.start(shared_from_this()); }
-
-  void shutdown() {
-    thread_.stop();
-    hub_->close();
+  void start() {
+    ProcessBus::instance().post(
+        [self = shared_from_this()] { ProcessBus::instance().addListener(self); });
   }
 
-  // Any thread. done runs exactly once: on the I/O thread, or on the caller's when the command
-  // is refused before it got there.
+  // Waits until every pending command has completed (posted to the queue) and the manager's
+  // matches and timer are gone.
+  void shutdown() {
+    hub_->close();
+    auto done = std::make_shared<std::promise<void>>();
+    std::future<void> finished = done->get_future();
+    ProcessBus::instance().post([self = shared_from_this(), done] {
+      self->closeOnBus();
+      done->set_value();
+    });
+    finished.wait();
+  }
+
+  // Any thread. done runs exactly once: in the bus's I/O context, or on the caller's thread when
+  // the command is refused before it got there.
   void submit(std::string command, MessageDict request, Done done) {
     if (inFlight_.fetch_add(1) >= kMaxPendingCommands) {
       inFlight_.fetch_sub(1);
@@ -171,9 +229,20 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
     }
     auto call = std::make_shared<CommandCall>(
         CommandCall{std::move(command), std::move(request), std::move(done)});
-    if (!thread_.post([this, call] { startCommand(call); })) {
-      finish(*call, bus::makeResult(kResultBusError, "client event loop unavailable"), {});
+    ProcessBus::instance().post([self = shared_from_this(), call] { self->startCommand(call); });
+  }
+
+  Result performSync(const std::string& command, const MessageDict& request, MessageValue& reply) {
+    if (!clientSendable_ || !bus::isSendableName(command)) {
+      return bus::makeResult(kResultInvalidRequest, "client or command name cannot be sent");
     }
+    MessageValue value;
+    Result result = ProcessBus::instance().call(
+        commandSpec(command),
+        [&](sd_bus_message* message) { return appendRequest(message, command, request); },
+        [&value](sd_bus_message* answer) { return bus::readOutcome(answer, value); });
+    reply = std::move(value);
+    return result;
   }
 
   void postCompletion(const std::shared_ptr<Completion>& box, Result result, MessageValue reply) {
@@ -196,106 +265,159 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
 
   void eventsOn() {
     hub_->on();
-    // Repeated calls before the I/O thread gets to them need one start only.
+    // Repeated calls before the I/O context gets to them need one start only.
     if (!startQueued_.exchange(true)) {
-      if (!thread_.post([this] {
-            startQueued_.store(false);
-            startEvents();
-          })) {
-        startQueued_.store(false);
-      }
+      ProcessBus::instance().post([self = shared_from_this()] {
+        self->startQueued_.store(false);
+        self->startEvents();
+      });
+    }
+  }
+
+  // --- I/O context ---
+
+  void connected(sd_bus* bus) override {
+    // An owner seen on a connection that went without our noticing is unknown now; the new
+    // connection's owner query tells whether it is still there.
+    if (!owner_.empty()) {
+      owner_.clear();
+      postStopped();
+    }
+    if (hub_->token() != 0) {
+      watch(bus);
+    }
+  }
+
+  void disconnected() override {
+    ownerMatch_.reset();
+    eventMatch_.reset();
+    if (!owner_.empty()) {
+      owner_.clear();
+      postStopped();
+    }
+    if (hub_->token() != 0) {
+      scheduleReconnect();
     }
   }
 
  private:
+  int appendRequest(sd_bus_message* message, const std::string& command,
+                    const MessageDict& request) const {
+    int r = sd_bus_message_append(message, "ss", client_.c_str(), command.c_str());
+    return r < 0 ? r : bus::appendDict(message, request);
+  }
+
   void finish(CommandCall& call, Result result, MessageValue value) {
     inFlight_.fetch_sub(1);
     call.done(std::move(result), std::move(value));
   }
 
-  // --- I/O thread ---
+  void closeOnBus() {
+    closed_ = true;
+    ProcessBus& bus = ProcessBus::instance();
+    bus.removeListener(this);
+    ownerMatch_.reset();
+    eventMatch_.reset();
+    reconnect_.reset();
+    bus.cancel(this, bus::makeResult(kResultConnectionLost, "client closed"));
+  }
 
   void startCommand(const std::shared_ptr<CommandCall>& call) {
+    if (closed_) {
+      finish(*call, bus::makeResult(kResultConnectionLost, "client closed"), {});
+      return;
+    }
     if (!clientSendable_ || !bus::isSendableName(call->command)) {
       finish(*call, bus::makeResult(kResultInvalidRequest, "client or command name cannot be sent"),
              {});
       return;
     }
-    thread_.callAsync(
-        bus::kServerName, bus::kServerPath, bus::kServerInterface, "PerformCommand",
+    ProcessBus::instance().callAsync(
+        commandSpec(call->command),
         [this, &call](sd_bus_message* message) {
-          int r = sd_bus_message_append(message, "ss", client_.c_str(), call->command.c_str());
-          return r < 0 ? r : bus::appendDict(message, call->request);
+          return appendRequest(message, call->command, call->request);
         },
         [this, call](const Result& failure, sd_bus_message* reply) {
           MessageValue value;
           Result result = reply != nullptr ? bus::readOutcome(reply, value) : failure;
+          Result logged = result;
           finish(*call, std::move(result), std::move(value));
-        });
+          return logged;
+        },
+        this);
   }
 
   void startEvents() {
-    if (hub_->token() == 0) {
+    if (closed_ || hub_->token() == 0) {
       return;
     }
-    subscribeWanted_ = true;
-    bool opened = false;
-    if (thread_.connection(&opened) == nullptr) {
+    const std::uint64_t watchedBefore = matchEpoch_;
+    sd_bus* bus = ProcessBus::instance().connection();
+    if (bus == nullptr) {
       scheduleReconnect();
-    } else if (!opened) {
-      // A fresh connection asks for the owner itself, in onConnected.
-      queryOwner();
+      return;
     }
-  }
-
-  void scheduleReconnect() {
-    thread_.runAfter(kReconnectDelay, [this] {
-      if (hub_->token() != 0 && thread_.connection() == nullptr) {
-        scheduleReconnect();
-      }
-    });
-  }
-
-  void onConnected(sd_bus* bus) {
-    // An owner seen on a connection that went without its Disconnected signal (we noticed first)
-    // is unknown now; the new connection's owner query tells whether it is still there.
-    if (!owner_.empty()) {
-      owner_.clear();
-      postStopped();
-    }
-    // The matches go first: the bus handles our messages in order, so no owner change after the
-    // owner query can slip by unseen. A match that cannot be installed costs us its signals but
-    // not the connection, which sd-bus would close without an install callback.
-    sd_bus_add_match_async(bus, nullptr, kOwnerChangedMatch, &ManagerCore::onOwnerChanged,
-                           &ManagerCore::onMatchInstalled, this);
-    sd_bus_match_signal_async(bus, nullptr, nullptr, bus::kServerPath, bus::kServerInterface,
-                              "Event", &ManagerCore::onEvent, &ManagerCore::onMatchInstalled, this);
-    if (hub_->token() != 0) {
+    if (matchEpoch_ != ProcessBus::instance().epoch()) {
+      watch(bus);
+    } else if (matchEpoch_ == watchedBefore) {
+      // Watched since an earlier EventsOn: ask again, so that the state is delivered anew. (A
+      // connection opened just now told connected(), which has asked already.)
       subscribeWanted_ = true;
       queryOwner();
     }
   }
 
-  void onDisconnected() {
-    if (!owner_.empty()) {
-      owner_.clear();
-      postStopped();
+  // Installs the matches on bus and asks who owns the server's name now.
+  void watch(sd_bus* bus) {
+    matchEpoch_ = ProcessBus::instance().epoch();
+    // The matches go first: the bus handles our messages in order, so no owner change after the
+    // owner query can slip by unseen. A match that cannot be installed costs us its signals but
+    // not the connection, which sd-bus would close without an install callback.
+    sd_bus_slot* slot = nullptr;
+    if (sd_bus_add_match_async(bus, &slot, kOwnerChangedMatch, &ManagerCore::onOwnerChanged,
+                               &ManagerCore::onMatchInstalled, this) >= 0) {
+      ownerMatch_.reset(slot);
     }
-    if (hub_->token() != 0) {
-      scheduleReconnect();
+    slot = nullptr;
+    if (sd_bus_match_signal_async(bus, &slot, nullptr, bus::kServerPath, bus::kServerInterface,
+                                  "Event", &ManagerCore::onEvent, &ManagerCore::onMatchInstalled,
+                                  this) >= 0) {
+      eventMatch_.reset(slot);
     }
+    subscribeWanted_ = true;
+    queryOwner();
+  }
+
+  void scheduleReconnect() {
+    if (closed_ || reconnect_) {
+      return;
+    }
+    reconnect_ = ProcessBus::instance().runAfter(kReconnectDelay, [weak = weak_from_this()] {
+      if (auto self = weak.lock()) {
+        self->reconnect_.reset();
+        if (!self->closed_ && self->hub_->token() != 0) {
+          self->startEvents();
+        }
+      }
+    });
   }
 
   void queryOwner() {
-    std::uint64_t epoch = thread_.epoch();
-    thread_.callAsync(
-        bus::kBusDriverName, bus::kBusDriverPath, bus::kBusDriverInterface, "GetNameOwner",
+    const std::uint64_t epoch = ProcessBus::instance().epoch();
+    ProcessBus::instance().callAsync(
+        {bus::kBusDriverName,
+         bus::kBusDriverPath,
+         bus::kBusDriverInterface,
+         "GetNameOwner",
+         bus::callBounds().subscribe,
+         nullptr,
+         {}},
         [](sd_bus_message* message) {
           return sd_bus_message_append(message, "s", bus::kServerName);
         },
         [this, epoch](const Result& failure, sd_bus_message* reply) {
-          if (epoch != thread_.epoch()) {
-            return;
+          if (epoch != ProcessBus::instance().epoch() || closed_) {
+            return failure;
           }
           const char* owner = nullptr;
           if (reply != nullptr && sd_bus_message_read(reply, "s", &owner) > 0) {
@@ -303,7 +425,9 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
           } else if (reply == nullptr && failure.code == kResultServerNotRunning) {
             ownerSeen("");
           }
-        });
+          return failure;
+        },
+        this);
   }
 
   // owner is the unique name now owning the server's name, empty when nobody does.
@@ -328,46 +452,32 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
     if (!clientSendable_) {
       return;
     }
-    std::string target = owner_;
-    std::uint64_t token = hub_->token();
-    std::uint64_t epoch = thread_.epoch();
+    const std::uint64_t token = hub_->token();
+    const std::uint64_t epoch = ProcessBus::instance().epoch();
     // Addressed to the owner's unique name: if that process goes, the answer cannot come from
     // its successor, which gets a Subscribe of its own.
-    thread_.callAsync(
-        target.c_str(), bus::kServerPath, bus::kServerInterface, "Subscribe",
+    ProcessBus::instance().callAsync(
+        {owner_.c_str(), bus::kServerPath, bus::kServerInterface, "Subscribe",
+         bus::callBounds().subscribe, "server", "Subscribe"},
         [this](sd_bus_message* message) {
           return sd_bus_message_append(message, "s", client_.c_str());
         },
-        [this, target, token, epoch](const Result&, sd_bus_message* reply) {
-          if (reply == nullptr || epoch != thread_.epoch() || target != owner_) {
-            return;
+        [this, target = owner_, token, epoch](const Result& failure, sd_bus_message* reply) {
+          if (reply == nullptr) {
+            return failure;
           }
           std::vector<std::pair<std::string, MessageValue>> events;
-          if (readEventList(reply, events)) {
+          if (!readEventList(reply, events)) {
+            return bus::makeResult(kResultBadReply, "Subscribe reply of the wrong shape");
+          }
+          if (epoch == ProcessBus::instance().epoch() && target == owner_ && !closed_) {
             for (auto& [name, payload] : events) {
               postEvent(token, name, std::move(payload));
             }
           }
-        });
-  }
-
-  static bool readEventList(sd_bus_message* reply,
-                            std::vector<std::pair<std::string, MessageValue>>& events) {
-    if (sd_bus_message_has_signature(reply, "a(sv)") <= 0 ||
-        sd_bus_message_enter_container(reply, 'a', "(sv)") <= 0) {
-      return false;
-    }
-    int r = 0;
-    while ((r = sd_bus_message_enter_container(reply, 'r', "sv")) > 0) {
-      const char* name = nullptr;
-      MessageValue payload;
-      if (events.size() >= kMaxSubscribeEvents || sd_bus_message_read(reply, "s", &name) <= 0 ||
-          bus::readVariant(reply, payload) < 0 || sd_bus_message_exit_container(reply) < 0) {
-        return false;
-      }
-      events.emplace_back(name, std::move(payload));
-    }
-    return r == 0 && sd_bus_message_exit_container(reply) >= 0;
+          return Result{};
+        },
+        this);
   }
 
   void postStopped() {
@@ -421,12 +531,14 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore> {
   std::atomic<std::size_t> inFlight_{0};
   std::atomic<bool> startQueued_{false};
 
-  // I/O thread only.
+  // I/O context only.
+  bool closed_ = false;
   std::string owner_;
   bool subscribeWanted_ = false;
-
-  // Last, so that it is the first to go: its thread may still use everything above.
-  BusThread thread_;
+  std::uint64_t matchEpoch_ = 0;
+  SlotPtr ownerMatch_;
+  SlotPtr eventMatch_;
+  ProcessBus::Timer reconnect_;
 };
 
 class Manager {
@@ -471,19 +583,10 @@ void EventsOn(const std::shared_ptr<Manager>& manager) {
 Result PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& command,
                       const MessageDict& request, MessageValue& reply) {
   reply = MessageValue();
-  std::shared_ptr<Manager> keep = manager;
-  if (!keep) {
+  if (!manager) {
     return bus::makeResult(kResultInvalidRequest, "no manager");
   }
-  // Shared with the I/O thread, which may still hold its side when this thread wakes up.
-  auto outcome = std::make_shared<std::promise<std::pair<Result, MessageValue>>>();
-  auto future = outcome->get_future();
-  keep->core().submit(command, request, [outcome](Result result, MessageValue value) {
-    outcome->set_value({std::move(result), std::move(value)});
-  });
-  auto [result, value] = future.get();
-  reply = std::move(value);
-  return result;
+  return manager->core().performSync(command, request, reply);
 }
 
 void PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& command,
@@ -497,7 +600,7 @@ void PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& 
   }
   ManagerCore& core = manager->core();
   auto box = std::make_shared<Completion>(std::move(completion));
-  // The I/O thread only ever sees the box, so the caller's completion can never be released
+  // The I/O context only ever sees the box, so the caller's completion can never be released
   // there; the ManagerCore outlives every call it completes.
   core.submit(command, request, [&core, box](Result result, MessageValue value) {
     core.postCompletion(box, std::move(result), std::move(value));

@@ -25,6 +25,8 @@ const char* priorityField(LogLevel level) {
       return "PRIORITY=6";
     case LogLevel::kNotice:
       return "PRIORITY=5";
+    case LogLevel::kWarning:
+      return "PRIORITY=4";
     case LogLevel::kError:
       return "PRIORITY=3";
   }

@@ -48,37 +48,38 @@ std::uint64_t monotonicUsec() {
          static_cast<std::uint64_t>(now.tv_nsec) / 1000u;
 }
 
-std::uint64_t callDeadline(sd_bus* bus) {
-  std::uint64_t timeout = 0;
-  if (sd_bus_get_method_call_timeout(bus, &timeout) < 0 || timeout == 0) {
-    return UINT64_MAX;
+Result resultFromErrno(sd_bus* bus, int r) {
+  std::string text = std::string("errno ") + std::to_string(-r) + ": " + std::strerror(-r);
+  if (bus != nullptr && sd_bus_is_open(bus) <= 0) {
+    return makeResult(kResultConnectionLost, text);
   }
-  return monotonicUsec() + timeout;
+  return makeResult(codeForLocalErrno(r), text);
 }
 
-Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r, bool deadlinePassed) {
-  const bool named = error != nullptr && sd_bus_error_is_set(error);
-  std::string text = named ? std::string(error->name) : std::string("errno ") + std::to_string(-r);
-  if (named && error->message != nullptr) {
+Result resultFromErrorReply(sd_bus* bus, sd_bus_message* reply) {
+  const sd_bus_error* error = sd_bus_message_get_error(reply);
+  if (error == nullptr || !sd_bus_error_is_set(error)) {
+    return makeResult(kResultBadReply, "error reply without a name");
+  }
+  std::string text = error->name;
+  if (error->message != nullptr) {
     text += ": ";
     text += error->message;
-  } else if (!named && r < 0) {
-    text += ": ";
-    text += std::strerror(-r);
   }
+  // Whatever sd-bus synthesises after our connection went (NoReply "Connection terminated") is
+  // our connection's fault, not the peer's.
   if (bus == nullptr || sd_bus_is_open(bus) <= 0) {
     return makeResult(kResultConnectionLost, text);
   }
-  if (!named) {
-    return makeResult(codeForLocalErrno(r), text);
-  }
-  if (sd_bus_error_has_names(error, SD_BUS_ERROR_NAME_HAS_NO_OWNER, SD_BUS_ERROR_SERVICE_UNKNOWN)) {
+  const char* sender = sd_bus_message_get_sender(reply);
+  const bool fromDriver = sender != nullptr && std::strcmp(sender, kBusDriverName) == 0;
+  if (fromDriver &&
+      sd_bus_error_has_names(error, SD_BUS_ERROR_NAME_HAS_NO_OWNER, SD_BUS_ERROR_SERVICE_UNKNOWN)) {
     return makeResult(kResultServerNotRunning, text);
   }
-  // The errno is -ETIMEDOUT for all of these; the name and the clock tell a crash from a slow
-  // peer.
+  // Time-outs are our own (ProcessBus), so a NoReply means the peer left without answering.
   if (sd_bus_error_has_name(error, SD_BUS_ERROR_NO_REPLY)) {
-    return makeResult(deadlinePassed ? kResultTimeout : kResultServerGone, text);
+    return makeResult(kResultServerGone, text);
   }
   if (sd_bus_error_has_name(error, SD_BUS_ERROR_TIMEOUT)) {
     return makeResult(kResultTimeout, text);
@@ -112,41 +113,8 @@ Result readOutcome(sd_bus_message* reply, MessageValue& value) {
     return makeResult(kResultBadReply,
                       std::string("reply value outside the mapping: ") + std::strerror(-r));
   }
-  Result result = makeResult(code, message != nullptr ? message : "");
-  if (result.ok()) {
-    value = std::move(decoded);
-  }
-  return result;
-}
-
-Result callSync(sd_bus* bus, const char* destination, const char* path, const char* interface,
-                const char* member, const MessageBuilder& build, MessagePtr& reply) {
-  sd_bus_message* raw = nullptr;
-  int r = sd_bus_message_new_method_call(bus, &raw, destination, path, interface, member);
-  if (r < 0) {
-    return resultFromFailure(bus, nullptr, r);
-  }
-  MessagePtr call(raw);
-  r = sd_bus_message_set_auto_start(call.get(), 0);
-  if (r < 0) {
-    return resultFromFailure(bus, nullptr, r);
-  }
-  r = build ? build(call.get()) : 0;
-  if (r < 0) {
-    return makeResult(kResultInvalidRequest,
-                      std::string("request cannot be encoded: ") + std::strerror(-r));
-  }
-  sd_bus_error error = SD_BUS_ERROR_NULL;
-  sd_bus_message* answer = nullptr;
-  std::uint64_t deadline = callDeadline(bus);
-  r = sd_bus_call(bus, call.get(), 0, &error, &answer);
-  if (r < 0) {
-    Result result = resultFromFailure(bus, &error, r, monotonicUsec() >= deadline);
-    sd_bus_error_free(&error);
-    return result;
-  }
-  reply.reset(answer);
-  return Result{};
+  value = std::move(decoded);
+  return makeResult(code, message != nullptr ? message : "");
 }
 
 }  // namespace halvex::bus

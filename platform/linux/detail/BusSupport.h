@@ -1,7 +1,6 @@
 // SPDX-License-Identifier: MIT
-// What every service of the host backend needs on the bus: the names of the protocol, the
-// mapping of bus failures to Result codes, owning pointers and a blocking call for the services
-// that are synchronous by contract. Nothing here keeps state between calls.
+// What every service of the host backend needs on the bus: the names of the protocol and the
+// mapping of bus failures to Result codes. Nothing here keeps state between calls.
 #pragma once
 
 #include <systemd/sd-bus.h>
@@ -32,6 +31,9 @@ inline constexpr char kBusDriverName[] = "org.freedesktop.DBus";
 inline constexpr char kBusDriverPath[] = "/org/freedesktop/DBus";
 inline constexpr char kBusDriverInterface[] = "org.freedesktop.DBus";
 
+// Where the platform's own entries in the system log come from.
+inline constexpr char kLogSubsystem[] = "org.halvex.platform";
+
 // Client, command and service names travel as strings; longer ones are refused locally so that a
 // caller's mistake costs nothing on the bus.
 inline constexpr std::size_t kMaxNameLength = 255;
@@ -39,13 +41,9 @@ inline constexpr std::size_t kMaxNameLength = 255;
 // Result messages are for logs only; a peer cannot make them grow beyond this.
 inline constexpr std::size_t kMaxResultMessage = 1024;
 
-struct BusCloser {
-  void operator()(sd_bus* bus) const { sd_bus_close_unref(bus); }
-};
 struct MessageReleaser {
   void operator()(sd_bus_message* message) const { sd_bus_message_unref(message); }
 };
-using BusPtr = std::unique_ptr<sd_bus, BusCloser>;
 using MessagePtr = std::unique_ptr<sd_bus_message, MessageReleaser>;
 
 // Non-empty, at most kMaxNameLength bytes and a valid bus string.
@@ -56,31 +54,25 @@ std::string boundedText(std::string_view text);
 
 Result makeResult(std::int32_t code, std::string_view message);
 
-// The outcome of a call that failed: error is the bus error (may be unset) and r the negative
-// errno sd-bus returned. bus is the connection the call went out on; once it is no longer open,
-// every failure is our connection's fault, whatever name sd-bus gave it. deadlinePassed says
-// that the call's time-out had run out when the failure came: sd-bus reports its own time-out of
-// an asynchronous call as NoReply, under the same sender as a peer that crashed.
-Result resultFromFailure(sd_bus* bus, const sd_bus_error* error, int r,
-                         bool deadlinePassed = false);
-
-// The monotonic time, and the moment a call sent now on bus times out.
+// The monotonic clock in microseconds, as sd-event counts it.
 std::uint64_t monotonicUsec();
-std::uint64_t callDeadline(sd_bus* bus);
+
+// The outcome of a call that sd-bus refused with the negative errno r on bus (null when no
+// connection was involved). Once the connection is no longer open every failure is its fault.
+Result resultFromErrno(sd_bus* bus, int r);
+
+// The outcome carried by an error reply. Only the bus driver can say that a name has no owner:
+// the same error names sent by the peer itself are plain failures.
+Result resultFromErrorReply(sd_bus* bus, sd_bus_message* reply);
 
 // The outcome when sd_bus_open_system itself failed with r: there is no bus to reach anyone on.
 Result resultFromOpenFailure(int r);
 
-// Reads a method reply "isv" (code, message, reply). A code other than 0 is returned as the
-// Result with value left null; anything but "isv" gives kResultBadReply.
+// Reads a method reply "isv" (code, message, reply) into the outcome and value, whatever the
+// code: a caller that needs success checks it. Anything but "isv", or a value outside the
+// mapping, gives kResultBadReply with value left as it was.
 Result readOutcome(sd_bus_message* reply, MessageValue& value);
 
 using MessageBuilder = std::function<int(sd_bus_message*)>;
-
-// Calls member of destination synchronously on bus with sd-bus's default time-out and auto-start
-// off. build appends the arguments; a negative return from it gives kResultInvalidRequest. On
-// success reply holds the method return.
-Result callSync(sd_bus* bus, const char* destination, const char* path, const char* interface,
-                const char* member, const MessageBuilder& build, MessagePtr& reply);
 
 }  // namespace halvex::bus

@@ -29,7 +29,11 @@ void TaskGroup::leave() const {
     std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
     std::abort();
   }
-  if (--state_->count == 0) {
+  const bool drained = --state_->count == 0;
+  lock.unlock();
+  // Outside the lock, so that a woken waiter does not block on it at once. This handle keeps the
+  // state alive meanwhile.
+  if (drained) {
     state_->drained.notify_all();
   }
 }

@@ -42,6 +42,23 @@ TEST(ToolSession, OneShotTelephonyWithReasonAndNonui) {
       }));
 }
 
+// A reason that is not UTF-8 cannot be sent as a string: the dump still goes, with a null reason.
+TEST(ToolSession, AReasonTheBusCannotCarryTravelsAsNull) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
+    "server": {"commands": {"TraceDumpState": {"timestamp": "T2"}}}})");
+  const test::RunResult run = runTool({"logdump", "tel", "nocompress", "caf\xe9"});
+  EXPECT_EQ(run.status.describe(), "exit 0");
+  EXPECT_EQ(run.out, "Telephony log collection: Success\nPath = " + kSnapshot + "T2-*\n");
+  EXPECT_EQ(run.err, "");
+  EXPECT_EQ(commandRequests(sim),
+            (std::vector<json>{serverRequest(
+                "TraceDumpState",
+                {key("TraceAction", "CollectTelephonyLogs"),
+                 {{"key", "TraceDumpStateReason"}, {"type", "null"}, {"value", nullptr}},
+                 key("TraceDumpStatePerformCompression", false)})}));
+}
+
 TEST(ToolSession, OneShotCoredumpInSystemLogsMode3) {
   test::PrivateBus bus;
   test::SimProcess sim(bus, "{" + kExemptDevice + R"(,

@@ -221,29 +221,40 @@ struct Daemon::Impl {
 };
 
 // Handlers may reply later: they return 1 once the request is theirs, whether or not answered.
+// Argument names are those of data/dbus/interfaces/*.xml, which a test holds equal to these.
 const sd_bus_vtable Daemon::Impl::kServerVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("PerformCommand", "ssa{sv}", "isv", &Impl::onPerformCommand,
-                  SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("Subscribe", "s", "a(sv)", &Impl::onSubscribe, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_SIGNAL("Event", "sv", 0), SD_BUS_VTABLE_END};
+    SD_BUS_METHOD_WITH_NAMES("PerformCommand", "ssa{sv}",
+                             SD_BUS_PARAM(client) SD_BUS_PARAM(command) SD_BUS_PARAM(request),
+                             "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
+                             &Impl::onPerformCommand, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("Subscribe", "s", SD_BUS_PARAM(client), "a(sv)", SD_BUS_PARAM(events),
+                             &Impl::onSubscribe, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_SIGNAL_WITH_NAMES("Event", "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), 0),
+    SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kHelperVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("Perform", "sisa{sv}", "isv", &Impl::onHelperPerform, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("Perform", "sisa{sv}",
+                             SD_BUS_PARAM(service) SD_BUS_PARAM(task) SD_BUS_PARAM(command)
+                                 SD_BUS_PARAM(request),
+                             "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
+                             &Impl::onHelperPerform, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kDeviceVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("GetIdentity", "", "a{sv}", &Impl::onGetIdentity, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("GetIdentity", "", "", "a{sv}", SD_BUS_PARAM(identity),
+                             &Impl::onGetIdentity, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kControlVtable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_METHOD("EmitState", "", "", &Impl::onEmitState, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("EmitEvent", "sv", "", &Impl::onEmitEvent, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("SetServerPresent", "b", "", &Impl::onSetServerPresent,
-                  SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("EmitEvent", "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), "", "",
+                             &Impl::onEmitEvent, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("SetServerPresent", "b", SD_BUS_PARAM(present), "", "",
+                             &Impl::onSetServerPresent, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD("Quit", "", "", &Impl::onQuit, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 

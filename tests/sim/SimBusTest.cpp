@@ -8,7 +8,9 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <memory>
+#include <regex>
 #include <thread>
 
 #include "platform/ServerProtocol.h"
@@ -217,6 +219,52 @@ TEST(SimBus, DefaultScenarioIsAWorkingDevice) {
   const Answer status = client.helper(helper::kCommandVarniskStatus);
   EXPECT_EQ(status.code, 0);
   EXPECT_EQ(stringAt(status.value, helper::kKeyTimestampString).size(), 19U);
+}
+
+// The members of interface in introspection XML, one line each ("method Quit", "arg in s name"),
+// so that comments, layout and attribute order do not count but names, types and order do.
+std::vector<std::string> members(const std::string& xml, const std::string& interface) {
+  const std::string text = std::regex_replace(xml, std::regex("<!--[^]*?-->"), "");
+  const std::size_t begin = text.find("<interface name=\"" + interface + "\"");
+  const std::size_t end = text.find("</interface>", begin);
+  if (begin == std::string::npos || end == std::string::npos)
+    return {"no interface " + interface};
+  const std::string body = text.substr(begin, end - begin);
+  const std::regex tag(R"(<(method|signal|property|arg|annotation)\b([^>]*)>)");
+  const std::regex attribute(R"re((\w+)="([^"]*)")re");
+  std::vector<std::string> out;
+  std::string parent;
+  for (std::sregex_iterator t(body.begin(), body.end(), tag), last; t != last; ++t) {
+    std::map<std::string, std::string> a;
+    const std::string attributes = (*t)[2];
+    for (std::sregex_iterator i(attributes.begin(), attributes.end(), attribute); i != last; ++i)
+      a[(*i)[1]] = (*i)[2];
+    const std::string kind = (*t)[1];
+    if (kind == "arg") {
+      const std::string direction = parent == "signal" ? "out" : "in";
+      out.push_back("arg " + (a.count("direction") ? a["direction"] : direction) + " " + a["type"] +
+                    " " + a["name"]);
+    } else {
+      parent = kind;
+      out.push_back(kind + " " + a["name"] + " " + a["type"] + a["access"] + a["value"]);
+    }
+  }
+  return out;
+}
+
+TEST(SimBus, IntrospectionMatchesTheInstalledInterfaceFiles) {
+  PrivateBus bus;
+  SimProcess sim(bus, "{}");
+  for (const std::string name : {"Server", "Helper", "Device", "Simulator"}) {
+    const std::string interface = "org.halvex." + name + "1";
+    std::ifstream file(std::string(HALVEX_INTERFACE_DIR) + "/" + interface + ".xml");
+    const std::string xml{std::istreambuf_iterator<char>(file), {}};
+    const RunResult live =
+        bus.busctl({"introspect", "--xml-interface", "org.halvex." + name, "/org/halvex/" + name});
+    ASSERT_EQ(live.status.describe(), "exit 0") << live.err;
+    EXPECT_EQ(members(live.out, interface), members(xml, interface));
+    EXPECT_GT(members(xml, interface).size(), 1U) << interface;
+  }
 }
 
 TEST(SimBus, RepliesTakeTheShapeAndCodeTheScenarioGives) {

@@ -100,6 +100,19 @@ std::string localTimestamp() {
   return std::string(text, n);
 }
 
+// The reply's TimestampString, or nullopt for none; stampedByDefault for a dump and the helper.
+std::optional<std::string> replyTimestamp(const Answer& answer, bool stampedByDefault) {
+  switch (answer.stamp) {
+    case Stamp::kText:
+      return answer.timestamp;
+    case Stamp::kNone:
+      return std::nullopt;
+    case Stamp::kDefault:
+      break;
+  }
+  return stampedByDefault ? std::optional(localTimestamp()) : std::nullopt;
+}
+
 // What a request is answered with once its time comes.
 struct Reply {
   std::int32_t code = 0;
@@ -582,9 +595,11 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
 
     const Answer answer = server.commandAnswer(command);
     const bool dump = std::string_view(command) == kCommandTraceDumpState;
-    const std::string timestamp = answer.timestamp.value_or(dump ? localTimestamp() : "");
+    const std::optional<std::string> stamp = replyTimestamp(answer, dump);
+    // Without one the tool reads an empty time stamp, and so does the log set.
+    const std::string timestamp = stamp.value_or("");
     MessageDict dict;
-    if (dump || answer.timestamp)
+    if (stamp)
       dict.set(kKeyTimestampString, MessageValue::string(timestamp));
     Reply reply = makeReply(answer, std::move(dict), timestamp);
     if (dump && answer.result == 0) {
@@ -669,9 +684,11 @@ int Daemon::Impl::onHelperPerform(sd_bus_message* call, void* userdata, sd_bus_e
       return 1;
     }
     const Answer& answer = impl->scenario.helper.status;
-    const std::string timestamp = answer.timestamp.value_or(localTimestamp());
+    const std::optional<std::string> stamp = replyTimestamp(answer, true);
+    const std::string timestamp = stamp.value_or("");
     MessageDict dict;
-    dict.set(helper::kKeyTimestampString, MessageValue::string(timestamp));
+    if (stamp)
+      dict.set(helper::kKeyTimestampString, MessageValue::string(timestamp));
     Reply reply = makeReply(answer, std::move(dict), timestamp);
     // The tool prints the folder of that time stamp; make sure it is there.
     if (answer.result == 0 && answer.reply == ReplyKind::kDict && !timestamp.empty()) {

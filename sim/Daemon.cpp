@@ -3,6 +3,7 @@
 
 #include <signal.h>
 #include <systemd/sd-bus.h>
+#include <systemd/sd-daemon.h>
 #include <systemd/sd-event.h>
 #include <unistd.h>
 
@@ -356,13 +357,20 @@ void Daemon::Impl::fatal(const std::string& message) {
 }
 
 void Daemon::Impl::checkReady() {
-  if (readySent || options.readyFd < 0)
+  if (readySent)
     return;
+  std::string names;
   for (const Endpoint* endpoint : presentAtStart) {
     if (!endpoint->owned)
       return;
+    names += (names.empty() ? "" : ", ") + std::string(endpoint->name);
   }
   readySent = true;
+  // The service manager first, so that whoever the descriptor wakes finds both told.
+  const std::string status = "READY=1\nSTATUS=Serving " + names + " from " + options.scenarioPath;
+  sd_notify(0, status.c_str());
+  if (options.readyFd < 0)
+    return;
   const char line[] = "ready\n";
   // Whoever waits may have gone; SIGPIPE is ignored, so a failed write is only that.
   [[maybe_unused]] const ssize_t n = ::write(options.readyFd, line, sizeof line - 1);
@@ -790,6 +798,7 @@ Daemon::~Daemon() = default;
 
 int Daemon::run() {
   const int r = sd_event_loop(impl_->event.get());
+  sd_notify(0, "STOPPING=1");
   return r < 0 ? 1 : r;
 }
 

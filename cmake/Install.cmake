@@ -14,6 +14,8 @@ halvex_pkg_config_dir(HALVEX_UNIT_DIR systemd systemd_system_unit_dir lib/system
 halvex_pkg_config_dir(HALVEX_SYSUSERS_DIR systemd sysusers_dir lib/sysusers.d)
 
 install(TARGETS halvextool halvex-sim RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT tool)
+halvex_strip_installed(tool OPTIONS --remove-section=.comment --remove-section=.note FILES
+  ${CMAKE_INSTALL_BINDIR}/halvextool ${CMAKE_INSTALL_BINDIR}/halvex-sim)
 
 # Manual pages, compressed as Debian installs them.
 set(halvex_man_pages man/halvextool.1 man/halvex-sim.8)

@@ -51,3 +51,20 @@ function(halvex_install_configured template)
          FILE_PERMISSIONS OWNER_READ OWNER_WRITE GROUP_READ WORLD_READ)"
     COMPONENT ${ARG_COMPONENT})
 endfunction()
+
+# halvex_strip_installed(<component> OPTIONS <strip options...> FILES <paths...>)
+# Runs strip with <options> on the installed <paths> (relative to the prefix) when the install
+# strips (cmake --install --strip, cpack): for what install(TARGETS) leaves, the debug sections
+# of static archives and the .comment and .note sections Debian's own strip removes.
+function(halvex_strip_installed component)
+  cmake_parse_arguments(ARG "" "" "OPTIONS;FILES" ${ARGN})
+  install(CODE "
+    if(CMAKE_INSTALL_DO_STRIP)
+      foreach(file ${ARG_FILES})
+        execute_process(COMMAND \"${CMAKE_STRIP}\" ${ARG_OPTIONS}
+                                \"\$ENV{DESTDIR}\${CMAKE_INSTALL_PREFIX}/\${file}\"
+                        COMMAND_ERROR_IS_FATAL ANY)
+      endforeach()
+    endif()"
+    COMPONENT ${component})
+endfunction()

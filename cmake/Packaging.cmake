@@ -53,7 +53,6 @@ endforeach()
 set(CPACK_PACKAGE_NAME ${PROJECT_NAME})
 set(CPACK_PACKAGE_VENDOR "halvextool authors")
 set(CPACK_PACKAGE_CONTACT "halvextool authors <halvextool@example.org>")
-set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "console to the Halvex baseband-manager server")
 set(CPACK_RESOURCE_FILE_LICENSE ${PROJECT_SOURCE_DIR}/LICENSE)
 set(CPACK_PACKAGE_DIRECTORY ${PROJECT_BINARY_DIR}/packages)
 set(CPACK_GENERATOR DEB)
@@ -104,6 +103,8 @@ halvexdiag group collect logs.")
 set(CPACK_DEBIAN_TRACE_PACKAGE_NAME ${HALVEX_TRACE_PACKAGE})
 set(CPACK_DEBIAN_TRACE_PACKAGE_SECTION libs)
 set(CPACK_DEBIAN_TRACE_PACKAGE_MULTIARCH same)
+set(CPACK_DEBIAN_TRACE_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/data/debian/triggers)
+set(CPACK_POST_BUILD_SCRIPTS ${CMAKE_CURRENT_LIST_DIR}/DebLdconfigScripts.cmake)
 set(CPACK_COMPONENT_TRACE_DESCRIPTION
 "Halvex trace support library
 The trace catalogue and support rules, log locations and file naming,

@@ -29,6 +29,12 @@ install(TARGETS halvex_trace EXPORT HalvexTraceTargets
 install(TARGETS halvex_platform_static halvex_trace_linux halvex_trace_linux_static
   EXPORT HalvexTraceTargets
   ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT trace_dev)
+halvex_strip_installed(trace OPTIONS --remove-section=.comment --remove-section=.note FILES
+  ${CMAKE_INSTALL_LIBDIR}/$<TARGET_FILE_NAME:halvex_trace_shared>
+  ${CMAKE_INSTALL_LIBDIR}/$<TARGET_FILE_NAME:halvex_platform_shared>)
+halvex_strip_installed(trace_dev OPTIONS --strip-debug --remove-section=.comment FILES
+  ${CMAKE_INSTALL_LIBDIR}/$<TARGET_FILE_NAME:halvex_trace>
+  ${CMAKE_INSTALL_LIBDIR}/$<TARGET_FILE_NAME:halvex_platform_static>)
 install(FILES
     ${PROJECT_SOURCE_DIR}/platform/DevicePropertyService.h
     ${PROJECT_SOURCE_DIR}/platform/DeviceQueries.h

@@ -98,6 +98,16 @@ const std::string kDeepArrayPointer = repeat("/0", 64);
 const std::string kDeepPayload =
     R"({"server": {"state": {"payload": )" + repeat(R"({"a": )", 17) + "1" + repeat("}", 20);
 const std::string kDeepPointer = "/server/state/payload" + repeat("/a", 16);
+// {"k0": value, "k1": value, ...}
+std::string entries(int count, const std::string& value = "0") {
+  std::string text = "{";
+  for (int i = 0; i < count; ++i)
+    text += (i ? R"(, "k)" : R"("k)") + std::to_string(i) + R"(": )" + value;
+  return text + "}";
+}
+const std::string kWidePayload = R"({"server": {"state": {"payload": )" + entries(1025) + "}}}";
+const std::string kHeavyPayload =
+    R"({"server": {"state": {"payload": )" + entries(17, entries(1000)) + "}}}";
 
 TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
   const struct {
@@ -160,6 +170,8 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
       {R"({"server": {"state": {"payload": 0.5}}})", "/server/state/payload",
        "a fractional number has no form on the bus"},
       {kDeepPayload, kDeepPointer, "nested deeper than 16"},
+      {kWidePayload, "/server/state/payload", "more than 1024 entries"},
+      {kHeavyPayload, "/server/state/payload/k16/k366", "more than 16384 values"},
       {R"({"server": {"properties": {"BasebandTrace": 1}}})", "/server/properties/BasebandTrace",
        "expected an object"},
       {R"({"server": {"properties": {"BasebandTrace": {"Enabled": {"value": 1}}}}})",

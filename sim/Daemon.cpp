@@ -654,9 +654,9 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
                      {"command", command},
                      {"keys", describeKeys(request)}});
 
-    const Server& server = impl->scenario.server;
+    const Server& configured = impl->scenario.server;
     if (std::string_view(command) == kCommandGetTraceProperty) {
-      const PropertyAnswer property = server.propertyAnswer(
+      const PropertyAnswer property = configured.propertyAnswer(
           request.getString(kKeyTraceName), request.getString(kKeyTracePropertyName));
       MessageDict dict;
       if (property.value)
@@ -668,7 +668,7 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
       return 1;
     }
 
-    const Answer answer = server.commandAnswer(command);
+    const Answer answer = configured.commandAnswer(command);
     const bool dump = std::string_view(command) == kCommandTraceDumpState;
     const std::optional<std::string> stamp = replyTimestamp(answer, dump);
     // Without one the tool reads an empty time stamp, and so does the log set.

@@ -221,7 +221,12 @@ PropertyAnswer readPropertyAnswer(const Json& value, const std::string& pointer)
   return property;
 }
 
-MessageValue readPayload(const Json& value, const std::string& pointer, int depth) {
+// A payload the bus can carry as one variant: the codec's depth, size and string limits, checked
+// here so that the daemon never holds an event it cannot send. values counts every value read.
+MessageValue readPayload(const Json& value, const std::string& pointer, int depth,
+                         std::size_t& values) {
+  if (++values > bus::kMaxValues)
+    fail(pointer, "more than " + std::to_string(bus::kMaxValues) + " values in one payload");
   switch (value.type()) {
     case Json::value_t::null:
       return MessageValue::null();
@@ -238,12 +243,15 @@ MessageValue readPayload(const Json& value, const std::string& pointer, int dept
       if (depth >= bus::kMaxDictDepth) {
         fail(pointer, "nested deeper than " + std::to_string(bus::kMaxDictDepth) + " objects");
       }
+      if (value.size() > bus::kMaxDictEntries) {
+        fail(pointer, "more than " + std::to_string(bus::kMaxDictEntries) + " entries");
+      }
       MessageDict dict;
       for (const auto& [key, item] : value.items()) {
         const std::string at = child(pointer, key);
         if (!bus::isBusString(key))
           fail(at, std::string("this key ") + kNotForTheBus);
-        dict.set(key, readPayload(item, at, depth + 1));
+        dict.set(key, readPayload(item, at, depth + 1, values));
       }
       return MessageValue::dict(std::move(dict));
     }
@@ -260,7 +268,8 @@ std::optional<StateEvent> readState(const Json& value, const std::string& pointe
   for (const auto& [key, item] : value.items()) {
     const std::string at = child(pointer, key);
     if (key == "payload") {
-      state.payload = readPayload(item, at, 0);
+      std::size_t values = 0;
+      state.payload = readPayload(item, at, 0, values);
     } else if (key == "when") {
       state.when = readChoice(item, at, kWhens);
     } else {

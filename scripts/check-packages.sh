@@ -54,6 +54,10 @@ printf '%s\n' "${lintian_out:-no errors, no warnings}"
 
 root="${scratch}/root"
 for deb in "${debs[@]}"; do dpkg-deb -x "${deb}" "${root}"; done
+# One version everywhere: the packages, the program, the pkg-config files.
+version=$(dpkg-deb -f "${debs[0]}" Version)
+[[ $("${root}/usr/bin/halvex-sim" --version) == "halvex-sim ${version}" ]] ||
+  fail "halvex-sim --version does not say ${version}"
 
 step "manual pages"
 for page in "${root}"/usr/share/man/man*/*.gz; do
@@ -105,6 +109,8 @@ cmake --build "${scratch}/consumer" -j "$(nproc)" >/dev/null
 pc_dir=$(dirname "$(find "${root}" -name halvex-trace.pc)")
 export PKG_CONFIG_SYSROOT_DIR="${root}"
 export PKG_CONFIG_PATH="${pc_dir}"
+[[ $(pkg-config --modversion halvex-trace halvex-trace-core) == "${version}"$'\n'"${version}" ]] ||
+  fail "the pkg-config files do not say ${version}"
 # shellcheck disable=SC2046 # the flags are words
 g++ -std=c++20 -o "${scratch}/consumer/pc_bus_consumer" "${consumer}/BusConsumer.cpp" \
   $(pkg-config --cflags --libs halvex-trace)

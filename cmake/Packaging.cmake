@@ -92,8 +92,8 @@ set(CPACK_COMPONENT_TOOL_DESCRIPTION
 "console to the Halvex baseband-manager server
 halvextool collects diagnostic logs from a cellular modem's baseband-manager
 server: telephony logs, telephony logs with a baseband core dump, and baseband
-logs alone, through a helper when the server is down. It is a small
-hierarchical shell, interactive or given one command line.
+logs alone, through a helper when the server says it is not running. It is a
+small hierarchical shell, interactive or given one command line.
 .
 The package also holds halvex-sim, which plays the device, the server and the
 helper on the system bus for tests and demonstrations, with its service unit

@@ -1,7 +1,8 @@
 # SPDX-License-Identifier: MIT
 # Debian packages the build, the tests and the demo need. Sourced by the other scripts.
 halvex_packages=(cmake make g++ pkgconf libgtest-dev libgmock-dev libbenchmark-dev
-  libsystemd-dev nlohmann-json3-dev dbus-daemon systemd tar gzip util-linux procps)
+  libsystemd-dev nlohmann-json3-dev dbus-daemon systemd tar gzip util-linux procps mandoc
+  dpkg-dev file lintian groff-base bash-completion dbus-system-bus-common)
 
 ensure_packages() {
   local missing=() p

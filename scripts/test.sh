@@ -23,5 +23,6 @@ for preset in "${presets[@]}"; do
   else
     ctest --preset "${preset}" -j "${jobs}"
   fi
+  if [[ ${preset} == dev ]]; then bash scripts/check-packages.sh build/dev; fi
 done
 echo "=== all presets passed: ${presets[*]} ==="

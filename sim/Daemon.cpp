@@ -3,6 +3,7 @@
 
 #include <signal.h>
 #include <systemd/sd-bus.h>
+#include <systemd/sd-daemon.h>
 #include <systemd/sd-event.h>
 #include <unistd.h>
 
@@ -18,6 +19,7 @@
 #include <vector>
 
 #include "platform/ServerProtocol.h"
+#include "platform/SystemLog.h"
 #include "platform/linux/MessageCodec.h"
 #include "sim/LogSetWriter.h"
 #include "sim/ProcessKeeper.h"
@@ -41,6 +43,11 @@ constexpr char kControlPath[] = "/org/halvex/Simulator";
 constexpr char kControlInterface[] = "org.halvex.Simulator1";
 constexpr char kErrorNoState[] = "org.halvex.Simulator.Error.NoState";
 constexpr char kErrorServerAbsent[] = "org.halvex.Simulator.Error.ServerAbsent";
+
+// The journal's subsystem; each endpoint logs under its own category.
+constexpr char kLogSubsystem[] = "org.halvex.sim";
+// A reply's value in the journal is cut after this many bytes.
+constexpr std::size_t kMaxLoggedValue = 240;
 
 // The status of a fault "exit": neither success nor the bad-scenario status 2.
 constexpr int kFaultExitStatus = 3;
@@ -79,8 +86,10 @@ int guarded(sd_bus_error* error, Body body) noexcept {
 
 // Reads the request dictionary that ends every Perform method; a value outside the message types
 // is the caller's mistake and answered as such.
-int readRequest(sd_bus_message* call, sd_bus_error* error, MessageDict& request) {
+int readRequest(sd_bus_message* call, sd_bus_error* error, MessageDict& request,
+                const Logger& journal, const std::string& asked) {
   if (bus::readDict(call, request) < 0) {
+    journal.log(LogLevel::kInfo, asked + ": refused, a value outside the message types");
     return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
                             "the request holds a value outside the message types");
   }
@@ -100,16 +109,46 @@ std::string localTimestamp() {
   return std::string(text, n);
 }
 
+// The reply's TimestampString, or nullopt for none; stampedByDefault for a dump and the helper.
+std::optional<std::string> replyTimestamp(const Answer& answer, bool stampedByDefault) {
+  switch (answer.stamp) {
+    case Stamp::kText:
+      return answer.timestamp;
+    case Stamp::kNone:
+      return std::nullopt;
+    case Stamp::kDefault:
+      break;
+  }
+  return stampedByDefault ? std::optional(localTimestamp()) : std::nullopt;
+}
+
 // What a request is answered with once its time comes.
 struct Reply {
+  std::string asked;  // the method and command, for the journal
   std::int32_t code = 0;
   MessageValue value;
   std::optional<LogSet> logSet;  // written just before the reply goes out
   std::string description;
 };
 
-Reply makeReply(const Answer& answer, MessageDict dict, const std::string& text) {
+// "code 0, reply {...}" for the journal; a failure code also in the hexadecimal it is known by.
+std::string summary(const Reply& reply) {
+  std::string text = "code " + std::to_string(reply.code);
+  if (reply.code != 0) {
+    char hex[16];
+    std::snprintf(hex, sizeof hex, " (0x%08X)", static_cast<std::uint32_t>(reply.code));
+    text += hex;
+  }
+  std::string value = describe(reply.value);
+  if (value.size() > kMaxLoggedValue)
+    value = value.substr(0, kMaxLoggedValue) + "...";
+  return text + ", reply " + value;
+}
+
+Reply makeReply(std::string asked, const Answer& answer, MessageDict dict,
+                const std::string& text) {
   Reply reply;
+  reply.asked = std::move(asked);
   reply.code = answer.result;
   switch (answer.reply) {
     case ReplyKind::kDict:
@@ -139,9 +178,11 @@ struct Daemon::Impl {
     const char* path;
     const char* interface;
     const sd_bus_vtable* vtable;
-    BusPtr bus;
-    SlotPtr vtableSlot;
-    SlotPtr nameSlot;
+    const char* category;  // in the journal
+    Logger journal{};
+    BusPtr bus{};
+    SlotPtr vtableSlot{};
+    SlotPtr nameSlot{};
     bool owned = false;
   };
 
@@ -163,7 +204,8 @@ struct Daemon::Impl {
   // Setup and names.
   void connect(Endpoint& endpoint);
   void checkReady();
-  void fatal(const std::string& message);
+  // Logs and prints message, then ends the loop with status 1.
+  void fatal(const Endpoint& endpoint, const std::string& message);
   Deferred* defer(Endpoint* owner, std::uint32_t delayMs, std::function<void(Deferred&)> fire,
                   MessagePtr call = nullptr);
   void dropDeferred(Endpoint* owner);
@@ -174,8 +216,10 @@ struct Daemon::Impl {
 
   // Answers.
   void respond(Endpoint& endpoint, sd_bus_message* call, const Answer& answer, Reply reply);
-  void sendReply(sd_bus_message* call, const Reply& reply);
+  void sendReply(const Endpoint& endpoint, sd_bus_message* call, const Reply& reply);
   int emitEvent(const char* name, const MessageValue& payload);
+  // Answers a control call with error name, and logs that.
+  int refuse(sd_bus_error* error, const std::string& asked, const char* name, const char* text);
   std::int64_t vendorSeenByTool() const {
     return scenario.device.present ? scenario.device.radioVendor : 0;
   }
@@ -185,6 +229,7 @@ struct Daemon::Impl {
   static int onNameReleased(sd_bus_message* reply, void* userdata, sd_bus_error* error);
   static int onTimer(sd_event_source* source, std::uint64_t usec, void* userdata);
   static int onDefer(sd_event_source* source, void* userdata);
+  static int onBusMessage(sd_bus_message* message, void* userdata, sd_bus_error* error);
   static int onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static int onSubscribe(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static int onHelperPerform(sd_bus_message* call, void* userdata, sd_bus_error* error);
@@ -207,10 +252,11 @@ struct Daemon::Impl {
   // Declared before what refers to it, so it is destroyed after: connections detach from the
   // loop, messages from their connections.
   EventPtr event;
-  Endpoint server{this, kServerName, kServerPath, kServerInterface, kServerVtable, {}, {}, {}};
-  Endpoint helper{this, kHelperName, kHelperPath, kHelperInterface, kHelperVtable, {}, {}, {}};
-  Endpoint device{this, kDeviceName, kDevicePath, kDeviceInterface, kDeviceVtable, {}, {}, {}};
-  Endpoint control{this, kControlName, kControlPath, kControlInterface, kControlVtable, {}, {}, {}};
+  std::shared_ptr<LogServer> journal = LogServer::create();
+  Endpoint server{this, kServerName, kServerPath, kServerInterface, kServerVtable, "server"};
+  Endpoint helper{this, kHelperName, kHelperPath, kHelperInterface, kHelperVtable, "helper"};
+  Endpoint device{this, kDeviceName, kDevicePath, kDeviceInterface, kDeviceVtable, "device"};
+  Endpoint control{this, kControlName, kControlPath, kControlInterface, kControlVtable, "control"};
   std::list<std::unique_ptr<Deferred>> deferred;
   ServerState serverState = ServerState::kAbsent;
   // SetServerPresent calls waiting for the server to reach the state they asked for, in order.
@@ -221,29 +267,40 @@ struct Daemon::Impl {
 };
 
 // Handlers may reply later: they return 1 once the request is theirs, whether or not answered.
+// Argument names are those of data/dbus/interfaces/*.xml, which a test holds equal to these.
 const sd_bus_vtable Daemon::Impl::kServerVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("PerformCommand", "ssa{sv}", "isv", &Impl::onPerformCommand,
-                  SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("Subscribe", "s", "a(sv)", &Impl::onSubscribe, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_SIGNAL("Event", "sv", 0), SD_BUS_VTABLE_END};
+    SD_BUS_METHOD_WITH_NAMES("PerformCommand", "ssa{sv}",
+                             SD_BUS_PARAM(client) SD_BUS_PARAM(command) SD_BUS_PARAM(request),
+                             "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
+                             &Impl::onPerformCommand, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("Subscribe", "s", SD_BUS_PARAM(client), "a(sv)", SD_BUS_PARAM(events),
+                             &Impl::onSubscribe, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_SIGNAL_WITH_NAMES("Event", "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), 0),
+    SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kHelperVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("Perform", "sisa{sv}", "isv", &Impl::onHelperPerform, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("Perform", "sisa{sv}",
+                             SD_BUS_PARAM(service) SD_BUS_PARAM(task) SD_BUS_PARAM(command)
+                                 SD_BUS_PARAM(request),
+                             "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
+                             &Impl::onHelperPerform, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kDeviceVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD("GetIdentity", "", "a{sv}", &Impl::onGetIdentity, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("GetIdentity", "", "", "a{sv}", SD_BUS_PARAM(identity),
+                             &Impl::onGetIdentity, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
 const sd_bus_vtable Daemon::Impl::kControlVtable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_METHOD("EmitState", "", "", &Impl::onEmitState, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("EmitEvent", "sv", "", &Impl::onEmitEvent, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD("SetServerPresent", "b", "", &Impl::onSetServerPresent,
-                  SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("EmitEvent", "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), "", "",
+                             &Impl::onEmitEvent, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("SetServerPresent", "b", SD_BUS_PARAM(present), "", "",
+                             &Impl::onSetServerPresent, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD("Quit", "", "", &Impl::onQuit, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
@@ -257,6 +314,8 @@ Daemon::Impl::Impl(Scenario scenarioIn, DaemonOptions optionsIn)
     throw std::runtime_error(std::string("cannot create an event loop: ") + std::strerror(-r));
   }
   event.reset(rawEvent);
+  for (Endpoint* endpoint : {&server, &helper, &device, &control})
+    endpoint->journal = Logger({kLogSubsystem, endpoint->category}, journal);
 
   // sd-event takes signals through a signalfd, so they must be blocked first. A null handler
   // makes the loop exit with status 0.
@@ -273,7 +332,8 @@ Daemon::Impl::Impl(Scenario scenarioIn, DaemonOptions optionsIn)
   keeper.start(scenario.processes);
 
   connect(control);
-  // If the bus goes, nothing here can be reached any more.
+  // If the bus goes, nothing here can be reached any more: say so, then end.
+  sd_bus_add_filter(control.bus.get(), nullptr, &Impl::onBusMessage, this);
   sd_bus_set_exit_on_disconnect(control.bus.get(), 1);
   presentAtStart.push_back(&control);
   if (scenario.device.present) {
@@ -326,19 +386,36 @@ void Daemon::Impl::connect(Endpoint& endpoint) {
   }
 }
 
-void Daemon::Impl::fatal(const std::string& message) {
+void Daemon::Impl::fatal(const Endpoint& endpoint, const std::string& message) {
+  endpoint.journal.log(LogLevel::kError, message);
   std::fprintf(stderr, "halvex-sim: %s\n", message.c_str());
   sd_event_exit(event.get(), 1);
 }
 
+int Daemon::Impl::onBusMessage(sd_bus_message* message, void* userdata, sd_bus_error*) {
+  // sd-bus makes up this signal when the connection ends; exit-on-disconnect then ends the loop.
+  if (sd_bus_message_is_signal(message, "org.freedesktop.DBus.Local", "Disconnected") > 0) {
+    static_cast<Impl*>(userdata)->control.journal.log(LogLevel::kError,
+                                                      "the bus went away; exiting");
+  }
+  return 0;
+}
+
 void Daemon::Impl::checkReady() {
-  if (readySent || options.readyFd < 0)
+  if (readySent)
     return;
+  std::string names;
   for (const Endpoint* endpoint : presentAtStart) {
     if (!endpoint->owned)
       return;
+    names += (names.empty() ? "" : ", ") + std::string(endpoint->name);
   }
   readySent = true;
+  // The service manager first, so that whoever the descriptor wakes finds both told.
+  const std::string status = "READY=1\nSTATUS=Serving " + names + " from " + options.scenarioPath;
+  sd_notify(0, status.c_str());
+  if (options.readyFd < 0)
+    return;
   const char line[] = "ready\n";
   // Whoever waits may have gone; SIGPIPE is ignored, so a failed write is only that.
   [[maybe_unused]] const ssize_t n = ::write(options.readyFd, line, sizeof line - 1);
@@ -398,7 +475,7 @@ int Daemon::Impl::onDefer(sd_event_source*, void* userdata) {
     if (owned)
       owned->fire(*owned);
   } catch (const std::exception& e) {
-    impl->fatal(e.what());
+    impl->fatal(item->owner != nullptr ? *item->owner : impl->control, e.what());
   }
   return 0;
 }
@@ -408,12 +485,12 @@ int Daemon::Impl::onNameAcquired(sd_bus_message* reply, void* userdata, sd_bus_e
   Impl* impl = endpoint->impl;
   std::uint32_t outcome = 0;
   if (const sd_bus_error* error = sd_bus_message_get_error(reply)) {
-    impl->fatal(std::string("cannot own ") + endpoint->name + ": " + error->message);
+    impl->fatal(*endpoint, std::string("cannot own ") + endpoint->name + ": " + error->message);
     return 0;
   }
   // 1: now the owner; 4: already was. Anything else means someone else has it.
   if (sd_bus_message_read(reply, "u", &outcome) < 0 || (outcome != 1 && outcome != 4)) {
-    impl->fatal(std::string(endpoint->name) + " is already owned on this bus");
+    impl->fatal(*endpoint, std::string(endpoint->name) + " is already owned on this bus");
     return 0;
   }
   endpoint->owned = true;
@@ -474,6 +551,9 @@ void Daemon::Impl::settleServer() {
     auto& [call, want] = serverWaiters.front();
     if (want == present) {
       sd_bus_reply_method_return(call.get(), "");
+      control.journal.log(LogLevel::kInfo, present
+                                               ? "SetServerPresent true: the server is on the bus"
+                                               : "SetServerPresent false: the server is away");
       serverWaiters.pop_front();
       continue;
     }
@@ -490,27 +570,33 @@ void Daemon::Impl::respond(Endpoint& endpoint, sd_bus_message* call, const Answe
                            Reply reply) {
   switch (answer.fault) {
     case Fault::kExit:
-      // The request is already in the log (written unbuffered); nothing else may run.
+      // The request is already in the log (written unbuffered), and the journal has its entry
+      // once the call returns; nothing else may run.
+      endpoint.journal.log(LogLevel::kInfo, reply.asked + ": exit");
       ::_exit(kFaultExitStatus);
     case Fault::kNeverAnswer:
+      endpoint.journal.log(LogLevel::kInfo, reply.asked + ": never answered");
       defer(&endpoint, 0, nullptr, keep(call));
       return;
     case Fault::kNone:
       break;
   }
   if (answer.delayMs == 0) {
-    sendReply(call, reply);
+    sendReply(endpoint, call, reply);
     return;
   }
   defer(
       &endpoint, answer.delayMs,
-      [this, reply = std::move(reply)](Deferred& item) { sendReply(item.call.get(), reply); },
+      [this, &endpoint, reply = std::move(reply)](Deferred& item) {
+        sendReply(endpoint, item.call.get(), reply);
+      },
       keep(call));
 }
 
-void Daemon::Impl::sendReply(sd_bus_message* call, const Reply& reply) {
-  if (reply.logSet)
-    writer.write(*reply.logSet, reply.description);
+void Daemon::Impl::sendReply(const Endpoint& endpoint, sd_bus_message* call, const Reply& reply) {
+  std::string entry = reply.asked + ": " + summary(reply);
+  if (reply.logSet && writer.write(*reply.logSet, reply.description) && !options.logRoot.empty())
+    entry += ", logs at " + reply.logSet->written;
   sd_bus_message* raw = nullptr;
   int r = sd_bus_message_new_method_return(call, &raw);
   MessagePtr message(raw);
@@ -521,8 +607,12 @@ void Daemon::Impl::sendReply(sd_bus_message* call, const Reply& reply) {
     r = bus::appendVariant(raw, reply.value);
   if (r >= 0)
     r = sd_bus_send(nullptr, raw, nullptr);
-  if (r < 0)
+  if (r < 0) {
     std::fprintf(stderr, "halvex-sim: cannot send a reply: %s\n", std::strerror(-r));
+    endpoint.journal.log(LogLevel::kError, entry + ", not sent: " + std::strerror(-r));
+    return;
+  }
+  endpoint.journal.log(LogLevel::kInfo, entry);
 }
 
 int Daemon::Impl::emitEvent(const char* name, const MessageValue& payload) {
@@ -540,6 +630,12 @@ int Daemon::Impl::emitEvent(const char* name, const MessageValue& payload) {
   return r;
 }
 
+int Daemon::Impl::refuse(sd_bus_error* error, const std::string& asked, const char* name,
+                         const char* text) {
+  control.journal.log(LogLevel::kInfo, asked + ": " + name);
+  return sd_bus_error_set(error, name, text);
+}
+
 int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_error* error) {
   return guarded(error, [&] {
     auto* impl = static_cast<Impl*>(userdata);
@@ -548,8 +644,9 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
     int r = sd_bus_message_read(call, "ss", &client, &command);
     if (r < 0)
       return r;
+    const std::string asked = std::string("PerformCommand ") + command + " from " + client;
     MessageDict request;
-    if (r = readRequest(call, error, request); r < 0)
+    if (r = readRequest(call, error, request, impl->server.journal, asked); r < 0)
       return r;
     impl->log.write({{"service", "server"},
                      {"method", "PerformCommand"},
@@ -557,25 +654,29 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
                      {"command", command},
                      {"keys", describeKeys(request)}});
 
-    const Server& server = impl->scenario.server;
+    const Server& configured = impl->scenario.server;
     if (std::string_view(command) == kCommandGetTraceProperty) {
-      const PropertyAnswer property = server.propertyAnswer(
+      const PropertyAnswer property = configured.propertyAnswer(
           request.getString(kKeyTraceName), request.getString(kKeyTracePropertyName));
       MessageDict dict;
       if (property.value)
         dict.set(kKeyTracePropertyValue, MessageValue::string(*property.value));
       impl->respond(impl->server, call, property.answer,
-                    makeReply(property.answer, std::move(dict), property.value.value_or("")));
+                    makeReply(asked + " " + request.getString(kKeyTraceName) + "." +
+                                  request.getString(kKeyTracePropertyName),
+                              property.answer, std::move(dict), property.value.value_or("")));
       return 1;
     }
 
-    const Answer answer = server.commandAnswer(command);
+    const Answer answer = configured.commandAnswer(command);
     const bool dump = std::string_view(command) == kCommandTraceDumpState;
-    const std::string timestamp = answer.timestamp.value_or(dump ? localTimestamp() : "");
+    const std::optional<std::string> stamp = replyTimestamp(answer, dump);
+    // Without one the tool reads an empty time stamp, and so does the log set.
+    const std::string timestamp = stamp.value_or("");
     MessageDict dict;
-    if (dump || answer.timestamp)
+    if (stamp)
       dict.set(kKeyTimestampString, MessageValue::string(timestamp));
-    Reply reply = makeReply(answer, std::move(dict), timestamp);
+    Reply reply = makeReply(asked, answer, std::move(dict), timestamp);
     if (dump && answer.result == 0) {
       // The tool prints a path for "tel" and "core" only with a dictionary reply; for "bb" it
       // prints one whatever the reply, with an empty time stamp when it cannot read one.
@@ -625,6 +726,11 @@ int Daemon::Impl::onSubscribe(sd_bus_message* call, void* userdata, sd_bus_error
     if (r < 0)
       return r;
 
+    const bool inReply = state && state->when == StateWhen::kSubscribe;
+    impl->server.journal.log(
+        LogLevel::kInfo,
+        std::string("Subscribe from ") + client + ": " +
+            (inReply ? "the state event " + describe(state->payload) : std::string("no event")));
     if (state && state->when == StateWhen::kAfter) {
       impl->defer(&impl->server, state->afterMs, [impl](Deferred&) {
         impl->emitEvent(kEventServerStateChange, impl->scenario.server.state->payload);
@@ -643,8 +749,10 @@ int Daemon::Impl::onHelperPerform(sd_bus_message* call, void* userdata, sd_bus_e
     int r = sd_bus_message_read(call, "sis", &service, &task, &command);
     if (r < 0)
       return r;
+    const std::string asked =
+        std::string("Perform ") + command + " of " + service + ", task " + std::to_string(task);
     MessageDict request;
-    if (r = readRequest(call, error, request); r < 0)
+    if (r = readRequest(call, error, request, impl->helper.journal, asked); r < 0)
       return r;
     impl->log.write({{"service", "helper"},
                      {"method", "Perform"},
@@ -654,14 +762,16 @@ int Daemon::Impl::onHelperPerform(sd_bus_message* call, void* userdata, sd_bus_e
                      {"keys", describeKeys(request)}});
 
     if (std::string_view(command) != helper::kCommandVarniskStatus) {
-      impl->respond(impl->helper, call, Answer{}, makeReply(Answer{}, {}, ""));
+      impl->respond(impl->helper, call, Answer{}, makeReply(asked, Answer{}, {}, ""));
       return 1;
     }
     const Answer& answer = impl->scenario.helper.status;
-    const std::string timestamp = answer.timestamp.value_or(localTimestamp());
+    const std::optional<std::string> stamp = replyTimestamp(answer, true);
+    const std::string timestamp = stamp.value_or("");
     MessageDict dict;
-    dict.set(helper::kKeyTimestampString, MessageValue::string(timestamp));
-    Reply reply = makeReply(answer, std::move(dict), timestamp);
+    if (stamp)
+      dict.set(helper::kKeyTimestampString, MessageValue::string(timestamp));
+    Reply reply = makeReply(asked, answer, std::move(dict), timestamp);
     // The tool prints the folder of that time stamp; make sure it is there.
     if (answer.result == 0 && answer.reply == ReplyKind::kDict && !timestamp.empty()) {
       reply.logSet = logSetForHelper(timestamp, impl->vendorSeenByTool());
@@ -693,7 +803,11 @@ int Daemon::Impl::onGetIdentity(sd_bus_message* call, void* userdata, sd_bus_err
       r = bus::appendDict(raw, identity);
     if (r >= 0)
       r = sd_bus_send(nullptr, raw, nullptr);
-    return r < 0 ? r : 1;
+    if (r < 0)
+      return r;
+    impl->device.journal.log(LogLevel::kInfo,
+                             "GetIdentity: " + describe(MessageValue::dict(std::move(identity))));
+    return 1;
   });
 }
 
@@ -702,10 +816,11 @@ int Daemon::Impl::onEmitState(sd_bus_message* call, void* userdata, sd_bus_error
     auto* impl = static_cast<Impl*>(userdata);
     const std::optional<StateEvent>& state = impl->scenario.server.state;
     if (!state)
-      return sd_bus_error_set(error, kErrorNoState, "the scenario has no state event");
+      return impl->refuse(error, "EmitState", kErrorNoState, "the scenario has no state event");
     if (impl->emitEvent(kEventServerStateChange, state->payload) < 0) {
-      return sd_bus_error_set(error, kErrorServerAbsent, "the server is not on the bus");
+      return impl->refuse(error, "EmitState", kErrorServerAbsent, "the server is not on the bus");
     }
+    impl->control.journal.log(LogLevel::kInfo, "EmitState: sent " + describe(state->payload));
     return sd_bus_reply_method_return(call, "");
   });
 }
@@ -717,14 +832,15 @@ int Daemon::Impl::onEmitEvent(sd_bus_message* call, void* userdata, sd_bus_error
     int r = sd_bus_message_read(call, "s", &name);
     if (r < 0)
       return r;
+    const std::string asked = std::string("EmitEvent ") + name;
     MessageValue payload;
     if (bus::readVariant(call, payload) < 0) {
-      return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
-                              "the payload holds a value outside the message types");
+      return impl->refuse(error, asked, SD_BUS_ERROR_INVALID_ARGS,
+                          "the payload holds a value outside the message types");
     }
-    if (impl->emitEvent(name, payload) < 0) {
-      return sd_bus_error_set(error, kErrorServerAbsent, "the server is not on the bus");
-    }
+    if (impl->emitEvent(name, payload) < 0)
+      return impl->refuse(error, asked, kErrorServerAbsent, "the server is not on the bus");
+    impl->control.journal.log(LogLevel::kInfo, asked + ": sent " + describe(payload));
     return sd_bus_reply_method_return(call, "");
   });
 }
@@ -750,6 +866,7 @@ int Daemon::Impl::onQuit(sd_bus_message* call, void* userdata, sd_bus_error* err
   return guarded(error, [&] {
     auto* impl = static_cast<Impl*>(userdata);
     const int r = sd_bus_reply_method_return(call, "");
+    impl->control.journal.log(LogLevel::kInfo, "Quit: exiting");
     sd_event_exit(impl->event.get(), 0);
     return r < 0 ? r : 1;
   });
@@ -762,6 +879,7 @@ Daemon::~Daemon() = default;
 
 int Daemon::run() {
   const int r = sd_event_loop(impl_->event.get());
+  sd_notify(0, "STOPPING=1");
   return r < 0 ? 1 : r;
 }
 

@@ -13,20 +13,24 @@
 namespace halvex::sim {
 
 struct DaemonOptions {
-  std::string requestLog;  // empty: no log
-  std::string logRoot;     // empty: no log sets written
-  int readyFd = -1;        // -1: nobody to tell
+  std::string scenarioPath;  // where the scenario came from, for the service manager's status
+  std::string requestLog;    // empty: no log
+  std::string logRoot;       // empty: no log sets written
+  int readyFd = -1;          // -1: nobody to tell
 };
 
 class Daemon {
  public:
   // Connects to the system bus and starts the scenario's processes. Throws std::runtime_error.
+  // Once every name present at start is owned, tells the service manager (READY=1, when
+  // NOTIFY_SOCKET is set) and then options.readyFd.
   Daemon(Scenario scenario, DaemonOptions options);
   ~Daemon();
   Daemon(const Daemon&) = delete;
   Daemon& operator=(const Daemon&) = delete;
 
-  // Serves until SIGTERM, SIGINT, Quit or the loss of the bus. Returns the exit status.
+  // Serves until SIGTERM, SIGINT, Quit or the loss of the bus, then tells the service manager
+  // STOPPING=1. Returns the exit status.
   int run();
 
  private:

@@ -1,14 +1,19 @@
 // SPDX-License-Identifier: MIT
 #include "sim/Scenario.h"
 
-#include <fstream>
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
 #include <limits>
 #include <nlohmann/json.hpp>
 #include <set>
-#include <sstream>
 
 #include "platform/ServerProtocol.h"
 #include "platform/linux/MessageCodec.h"
+#include "platform/linux/detail/BusString.h"
 
 namespace halvex::sim {
 namespace {
@@ -19,18 +24,24 @@ using Json = nlohmann::ordered_json;
 constexpr std::size_t kMaxFileBytes = 1 << 20;
 // Deeper than any payload can be sent (kMaxDictDepth), shallow enough that nothing recursive
 // downstream can run out of stack.
-constexpr int kMaxJsonDepth = 64;
+constexpr std::size_t kMaxJsonDepth = 64;
 constexpr std::uint32_t kMaxDelayMs = 24 * 60 * 60 * 1000;
 constexpr std::size_t kMaxProcesses = 64;
 constexpr std::size_t kMaxProcessName = 255;  // one file name: the keeper links it in a folder
 
+// A JSON pointer token, with control characters (NUL and newline among them) written as \u00XX
+// so that a message naming the place stays one printable line.
 std::string escapePointerToken(std::string_view token) {
   std::string out;
-  for (char c : token) {
+  for (const char c : token) {
     if (c == '~') {
       out += "~0";
     } else if (c == '/') {
       out += "~1";
+    } else if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f) {
+      char escaped[8];
+      std::snprintf(escaped, sizeof escaped, "\\u%04x", static_cast<unsigned char>(c));
+      out += escaped;
     } else {
       out += c;
     }
@@ -97,6 +108,16 @@ std::string readString(const Json& value, const std::string& pointer) {
   if (!value.is_string())
     expected(pointer, "a string", value);
   return value.get<std::string>();
+}
+
+constexpr char kNotForTheBus[] = "holds NUL or a Unicode noncharacter, which the bus cannot carry";
+
+// A string the simulator sends: refused here, with its place, rather than failing on the bus.
+std::string readBusString(const Json& value, const std::string& pointer) {
+  std::string text = readString(value, pointer);
+  if (!bus::isBusString(text))
+    fail(pointer, kNotForTheBus);
+  return text;
 }
 
 // An integer in [low, high]; JSON numbers with a fraction or exponent are refused.
@@ -177,8 +198,14 @@ Answer readCommandAnswer(const Json& value, const std::string& pointer) {
   Answer answer;
   for (const auto& [key, item] : value.items()) {
     const std::string at = child(pointer, key);
-    if (!readAnswerKey(answer, key, item, at))
-      answer.timestamp = readString(item, at);
+    if (readAnswerKey(answer, key, item, at))
+      continue;
+    if (item.is_null()) {
+      answer.stamp = Stamp::kNone;
+    } else {
+      answer.stamp = Stamp::kText;
+      answer.timestamp = readBusString(item, at);
+    }
   }
   return answer;
 }
@@ -189,19 +216,24 @@ PropertyAnswer readPropertyAnswer(const Json& value, const std::string& pointer)
   for (const auto& [key, item] : value.items()) {
     const std::string at = child(pointer, key);
     if (!readAnswerKey(property.answer, key, item, at))
-      property.value = readString(item, at);
+      property.value = readBusString(item, at);
   }
   return property;
 }
 
-MessageValue readPayload(const Json& value, const std::string& pointer, int depth) {
+// A payload the bus can carry as one variant: the codec's depth, size and string limits, checked
+// here so that the daemon never holds an event it cannot send. values counts every value read.
+MessageValue readPayload(const Json& value, const std::string& pointer, int depth,
+                         std::size_t& values) {
+  if (++values > bus::kMaxValues)
+    fail(pointer, "more than " + std::to_string(bus::kMaxValues) + " values in one payload");
   switch (value.type()) {
     case Json::value_t::null:
       return MessageValue::null();
     case Json::value_t::boolean:
       return MessageValue::boolean(value.get<bool>());
     case Json::value_t::string:
-      return MessageValue::string(value.get<std::string>());
+      return MessageValue::string(readBusString(value, pointer));
     case Json::value_t::number_integer:
     case Json::value_t::number_unsigned:
       return MessageValue::int64(readInteger<std::int64_t>(
@@ -211,9 +243,15 @@ MessageValue readPayload(const Json& value, const std::string& pointer, int dept
       if (depth >= bus::kMaxDictDepth) {
         fail(pointer, "nested deeper than " + std::to_string(bus::kMaxDictDepth) + " objects");
       }
+      if (value.size() > bus::kMaxDictEntries) {
+        fail(pointer, "more than " + std::to_string(bus::kMaxDictEntries) + " entries");
+      }
       MessageDict dict;
       for (const auto& [key, item] : value.items()) {
-        dict.set(key, readPayload(item, child(pointer, key), depth + 1));
+        const std::string at = child(pointer, key);
+        if (!bus::isBusString(key))
+          fail(at, std::string("this key ") + kNotForTheBus);
+        dict.set(key, readPayload(item, at, depth + 1, values));
       }
       return MessageValue::dict(std::move(dict));
     }
@@ -230,7 +268,8 @@ std::optional<StateEvent> readState(const Json& value, const std::string& pointe
   for (const auto& [key, item] : value.items()) {
     const std::string at = child(pointer, key);
     if (key == "payload") {
-      state.payload = readPayload(item, at, 0);
+      std::size_t values = 0;
+      state.payload = readPayload(item, at, 0, values);
     } else if (key == "when") {
       state.when = readChoice(item, at, kWhens);
     } else {
@@ -336,31 +375,6 @@ void readHelper(Helper& helper, const Json& value, const std::string& pointer) {
   helper.status = readCommandAnswer(answer, pointer);
 }
 
-// The JSON parser itself is iterative, but refusing absurd nesting before parsing keeps every
-// later walk over the document shallow.
-void checkDepth(std::string_view text) {
-  int depth = 0;
-  bool inString = false;
-  for (std::size_t i = 0; i < text.size(); ++i) {
-    const char c = text[i];
-    if (inString) {
-      if (c == '\\') {
-        ++i;
-      } else if (c == '"') {
-        inString = false;
-      }
-    } else if (c == '"') {
-      inString = true;
-    } else if (c == '{' || c == '[') {
-      if (++depth > kMaxJsonDepth) {
-        fail("", "nested deeper than " + std::to_string(kMaxJsonDepth) + " levels");
-      }
-    } else if (c == '}' || c == ']') {
-      --depth;
-    }
-  }
-}
-
 std::string parseErrorPlace(std::string_view text, std::size_t byte) {
   std::size_t line = 1, column = 1;
   for (std::size_t i = 0; i + 1 < byte && i < text.size(); ++i) {
@@ -373,6 +387,105 @@ std::string parseErrorPlace(std::string_view text, std::size_t byte) {
   }
   return "line " + std::to_string(line) + ", column " + std::to_string(column);
 }
+
+// What the parser says is wrong, from "[json.exception...] parse error at ...: REASON; last read:
+// 'TEXT'". TEXT is raw input (a newline, a byte that is not UTF-8) and stays out of the message.
+std::string parseErrorReason(const std::string& what) {
+  const std::size_t begin = what.find(": ");
+  if (begin == std::string::npos)
+    return {};
+  return " (" + what.substr(begin + 2, what.find("; last read") - begin - 2) + ")";
+}
+
+// Builds the document from the parser's events rather than letting the library build it, so that
+// what is known only while reading comes with a place: where a number overflows, an integer too
+// long for 64 bits (which the library would silently turn into a fraction), nesting too deep.
+class DocumentReader final : public nlohmann::json_sax<Json> {
+ public:
+  explicit DocumentReader(std::string_view text) : text_(text) {}
+  Json& document() { return document_; }
+
+  bool null() override { return add(nullptr); }
+  bool boolean(bool value) override { return add(value); }
+  bool number_integer(number_integer_t value) override { return add(value); }
+  bool number_unsigned(number_unsigned_t value) override { return add(value); }
+  bool number_float(number_float_t value, const string_t& text) override {
+    if (text.find_first_of(".eE") == string_t::npos)
+      fail(place(), text + " is out of range (beyond 64 bits)");
+    return add(value);
+  }
+  bool string(string_t& value) override { return add(std::move(value)); }
+  bool binary(binary_t&) override { return false; }  // JSON text has no binary values
+  bool start_object(std::size_t) override { return open(Json::object()); }
+  bool key(string_t& key) override {
+    open_.back().key = std::move(key);
+    return true;
+  }
+  bool end_object() override { return close(); }
+  bool start_array(std::size_t) override { return open(Json::array()); }
+  bool end_array() override { return close(); }
+  bool parse_error(std::size_t byte, const std::string& token,
+                   const nlohmann::detail::exception& error) override {
+    // 406: a number too large for a double; it is complete, so its place is known.
+    if (error.id == 406)
+      fail(place(), token + " is out of range");
+    fail("", "not valid JSON at " + parseErrorPlace(text_, byte) + parseErrorReason(error.what()));
+  }
+
+ private:
+  struct Open {
+    Json* container;
+    std::string key;  // of the member being read, in an object
+  };
+
+  // The JSON pointer of the value being read. Only the innermost open container grows, so the
+  // others' last element is the open one.
+  std::string place() const {
+    std::string pointer;
+    for (std::size_t i = 0; i < open_.size(); ++i) {
+      const Open& o = open_[i];
+      if (!o.container->is_array()) {
+        pointer = child(pointer, o.key);
+      } else {
+        const std::size_t size = o.container->size();
+        pointer += "/" + std::to_string(i + 1 == open_.size() ? size : size - 1);
+      }
+    }
+    return pointer;
+  }
+
+  // Appending moves only the innermost container's elements, none of which is open: the
+  // pointers kept in open_ stay valid.
+  Json& insert(Json value) {
+    if (open_.empty())
+      return document_ = std::move(value);
+    Json& container = *open_.back().container;
+    if (container.is_array()) {
+      container.push_back(std::move(value));
+      return container.back();
+    }
+    return container[open_.back().key] = std::move(value);
+  }
+  bool add(Json value) {
+    insert(std::move(value));
+    return true;
+  }
+  bool open(Json container) {
+    if (open_.size() >= kMaxJsonDepth) {
+      fail(place(), "nested deeper than " + std::to_string(kMaxJsonDepth) + " levels");
+    }
+    open_.push_back({&insert(std::move(container)), {}});
+    return true;
+  }
+  bool close() {
+    open_.pop_back();
+    return true;
+  }
+
+  std::string_view text_;
+  Json document_;
+  std::vector<Open> open_;
+};
 
 }  // namespace
 
@@ -406,13 +519,10 @@ Scenario defaultScenario() {
 }
 
 Scenario parseScenario(std::string_view text) {
-  checkDepth(text);
-  Json document;
-  try {
-    document = Json::parse(text);
-  } catch (const Json::parse_error& error) {
-    fail("", "not valid JSON at " + parseErrorPlace(text, error.byte));
-  }
+  DocumentReader reader(text);
+  if (!Json::sax_parse(text, &reader))
+    fail("", "not valid JSON");
+  const Json& document = reader.document();
   Scenario scenario = defaultScenario();
   checkObject(document, "", {"device", "processes", "server", "helper"});
   for (const auto& [key, item] : document.items()) {
@@ -430,17 +540,32 @@ Scenario parseScenario(std::string_view text) {
 }
 
 Scenario loadScenario(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in)
-    throw std::runtime_error(path + ": cannot be read");
+  const auto unreadable = [&path](int error) {
+    return std::runtime_error(path + ": cannot be read: " + std::strerror(error));
+  };
+  const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0)
+    throw unreadable(errno);
   std::string text(kMaxFileBytes + 1, '\0');
-  in.read(text.data(), static_cast<std::streamsize>(text.size()));
-  if (in.bad())
-    throw std::runtime_error(path + ": cannot be read");
-  text.resize(static_cast<std::size_t>(in.gcount()));
-  if (text.size() > kMaxFileBytes) {
+  std::size_t size = 0;
+  int readError = 0;
+  while (size < text.size()) {
+    const ssize_t n = ::read(fd, text.data() + size, text.size() - size);
+    if (n < 0 && errno == EINTR)
+      continue;
+    if (n < 0)
+      readError = errno;
+    if (n <= 0)
+      break;
+    size += static_cast<std::size_t>(n);
+  }
+  ::close(fd);
+  if (readError != 0)
+    throw unreadable(readError);
+  if (size > kMaxFileBytes) {
     throw std::runtime_error(path + ": larger than " + std::to_string(kMaxFileBytes) + " bytes");
   }
+  text.resize(size);
   try {
     return parseScenario(text);
   } catch (const ScenarioError& error) {

@@ -25,11 +25,19 @@ enum class Fault {
   kExit,         // the simulator exits as the request arrives
 };
 
+// Where the TimestampString of a reply comes from.
+enum class Stamp {
+  kDefault,  // not given: the time of the request for a dump and the helper, none otherwise
+  kNone,     // given as null: the reply has no TimestampString
+  kText,     // Answer::timestamp
+};
+
 // How one request is answered.
 struct Answer {
   std::int32_t result = 0;  // the reply's code; 0 is success
   ReplyKind reply = ReplyKind::kDict;
-  std::optional<std::string> timestamp;  // TimestampString; unset: the time of the request
+  Stamp stamp = Stamp::kDefault;
+  std::string timestamp;  // with Stamp::kText
   std::uint32_t delayMs = 0;
   Fault fault = Fault::kNone;
 };

@@ -557,9 +557,9 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
                      {"command", command},
                      {"keys", describeKeys(request)}});
 
-    const Server& server = impl->scenario.server;
+    const Server& answers = impl->scenario.server;
     if (std::string_view(command) == kCommandGetTraceProperty) {
-      const PropertyAnswer property = server.propertyAnswer(
+      const PropertyAnswer property = answers.propertyAnswer(
           request.getString(kKeyTraceName), request.getString(kKeyTracePropertyName));
       MessageDict dict;
       if (property.value)
@@ -569,7 +569,7 @@ int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
       return 1;
     }
 
-    const Answer answer = server.commandAnswer(command);
+    const Answer answer = answers.commandAnswer(command);
     const bool dump = std::string_view(command) == kCommandTraceDumpState;
     const std::string timestamp = answer.timestamp.value_or(dump ? localTimestamp() : "");
     MessageDict dict;

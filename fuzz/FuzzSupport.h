@@ -3,6 +3,7 @@
 // check that stops the run with a message when a property does not hold.
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <cstdio>
@@ -13,9 +14,12 @@
 namespace halvex::fuzz {
 
 // Prints what failed and aborts, which libFuzzer reports as a crash and keeps the input for.
+// The detail is cut short: a value near the size limits describes itself in megabytes.
 [[noreturn]] inline void fail(const char* property, std::string_view detail = {}) {
-  std::fprintf(stderr, "property failed: %s\n%.*s\n", property, static_cast<int>(detail.size()),
-               detail.data());
+  constexpr std::size_t kShown = 2000;
+  std::fprintf(stderr, "property failed: %s\n%.*s%s\n", property,
+               static_cast<int>(std::min(detail.size(), kShown)), detail.data(),
+               detail.size() > kShown ? " ..." : "");
   std::abort();
 }
 

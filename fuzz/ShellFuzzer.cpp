@@ -92,6 +92,8 @@ Answer dumpAnswer(unsigned choice) {
 struct Scene {
   bool started;
   bool oneShot;
+  bool internalBuild;  // consults the helper when the server is down
+  bool helperCreatable;
   Answer enabled;
   Answer mode;
   Answer dump;
@@ -104,14 +106,10 @@ Scene readScene(FuzzInput& in) {
   const Answer enabled[] = {property("1"), property("true"), property("0"), failed(kResultTimeout)};
   const Answer modes[] = {property("0"), property("3"), property("0x3"),
                           ok(MessageValue::string("3"))};
-
-  fake::Device device;
-  device.internalBuild = (setup & 4) != 0;
-  FakePlatform& platform = FakePlatform::get();
-  platform.setDevice(device);
-  platform.setHelperCreatable((setup & 8) != 0);
   return Scene{(setup & 1) != 0,
                (setup & 2) != 0,
+               (setup & 4) != 0,
+               (setup & 8) != 0,
                enabled[answers & 3],
                modes[(answers >> 2) & 3],
                dumpAnswer((answers >> 4) & 7),
@@ -121,6 +119,10 @@ Scene readScene(FuzzInput& in) {
 
 void install(const Scene& scene) {
   FakePlatform& platform = FakePlatform::get();
+  fake::Device device;
+  device.internalBuild = scene.internalBuild;
+  platform.setDevice(device);
+  platform.setHelperCreatable(scene.helperCreatable);
   platform.setServerResponder([scene](const std::string& command, const MessageDict& request) {
     if (command != kCommandGetTraceProperty) {
       return scene.dump;

@@ -78,16 +78,6 @@ constexpr const char* kObjectPaths[] = {"/", "/org/halvex"};
 constexpr const char* kSignatures[] = {"", "s", "x", "a{sv}", "v", "i"};
 // Enough nodes to go past kMaxValues, few enough to keep one run short.
 constexpr std::size_t kNodeBudget = 80000;
-// Sizes of the rare large containers: around the entry limit (one such per input, as filling a
-// MessageDict is quadratic), or small enough to nest past the value limit (32 x 32 x 17).
-constexpr std::size_t kLargeSizes[] = {17, 32, 64, 100, 1023, 1024, 1025, 1030};
-constexpr std::size_t kAroundEntryLimit = 1000;
-
-// Keys of large dictionaries differ in length, so that the lookups of MessageDict::set, which
-// are what makes filling one quadratic, compare sizes rather than bytes.
-std::string largeKey(std::size_t index) {
-  return std::string(index + 1, 'k');
-}
 
 class Builder {
  public:
@@ -212,11 +202,7 @@ class Builder {
       }
       return;
     }
-    std::size_t copies = kLargeSizes[count & 7u];
-    if (copies >= kAroundEntryLimit) {
-      copies = largeUsed_ ? kLargeSizes[1] : copies;
-      largeUsed_ = true;
-    }
+    std::size_t copies = largeSizes_.pick(count);
     const std::size_t modulus = 1u + in_.integer<std::uint16_t>();
     const std::size_t before = budget_;
     const Value pattern = value(element);
@@ -234,7 +220,7 @@ class Builder {
 
   FuzzInput& in_;
   std::size_t budget_ = kNodeBudget;
-  bool largeUsed_ = false;
+  LargeSizes largeSizes_;
 };
 
 int append(sd_bus_message* message, const Value& value) {

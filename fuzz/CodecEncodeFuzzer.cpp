@@ -35,16 +35,6 @@ constexpr std::string_view kOddStrings[] = {
 };
 constexpr int kMaxGeneratedDepth = bus::kMaxDictDepth + 3;
 constexpr std::size_t kValueBudget = 40000;
-// Sizes of the rare large containers: around the entry limit (one such per input, as filling a
-// MessageDict is quadratic), or small enough to nest past the value limit (32 x 32 x 17).
-constexpr std::size_t kLargeSizes[] = {17, 32, 64, 100, 1023, 1024, 1025, 1030};
-constexpr std::size_t kAroundEntryLimit = 1000;
-
-// Keys of large dictionaries differ in length, so that the lookups of MessageDict::set, which
-// are what makes filling one quadratic, compare sizes rather than bytes.
-std::string largeKey(std::size_t index) {
-  return std::string(index + 1, 'k');
-}
 
 class Builder {
  public:
@@ -87,12 +77,7 @@ class Builder {
     const std::size_t before = budget_;
     const MessageValue pattern = value(depth);
     const std::size_t used = before - budget_ + 1;
-    std::size_t entries = kLargeSizes[count & 7u];
-    if (entries >= kAroundEntryLimit) {
-      entries = largeUsed_ ? kLargeSizes[1] : entries;
-      largeUsed_ = true;
-    }
-    entries = std::min(entries, budget_ / used);
+    const std::size_t entries = std::min(largeSizes_.pick(count), budget_ / used);
     budget_ -= entries * used;
     for (std::size_t i = 0; i < entries; ++i) {
       out.set(largeKey(i), pattern);
@@ -111,7 +96,7 @@ class Builder {
 
   FuzzInput& in_;
   std::size_t budget_ = kValueBudget;
-  bool largeUsed_ = false;
+  LargeSizes largeSizes_;
 };
 
 // What the codec may do with a value. Whether a string can travel is sd-bus's own call, asked on

@@ -1,12 +1,16 @@
 // SPDX-License-Identifier: MIT
-// sd-bus messages for the fuzz targets, without a bus daemon: sd-bus only creates messages on a
-// started bus, so the process starts one on one end of a socket pair that nothing ever reads.
+// What the targets that build messages share: sd-bus messages without a bus daemon (sd-bus only
+// creates messages on a started bus, so the process starts one on one end of a socket pair that
+// nothing ever reads), and the sizes of the large dictionaries they build.
 #pragma once
 
 #include <sys/socket.h>
 #include <systemd/sd-bus.h>
 
+#include <cstddef>
+#include <cstdint>
 #include <memory>
+#include <string>
 
 #include "fuzz/FuzzSupport.h"
 
@@ -44,6 +48,30 @@ inline int sealForReading(sd_bus_message* message) {
     return r;
   }
   return sd_bus_message_rewind(message, 1);
+}
+
+// Sizes of the rare large dictionaries: around the entry limit, at most one per input since
+// filling a MessageDict is quadratic, or small enough to nest past the value limit (32 x 32 x 17).
+class LargeSizes {
+ public:
+  std::size_t pick(std::uint8_t choice) {
+    constexpr std::size_t kSizes[] = {17, 32, 64, 100, 1023, 1024, 1025, 1030};
+    std::size_t size = kSizes[choice & 7u];
+    if (size >= 1000) {
+      size = aroundLimitTaken_ ? kSizes[1] : size;
+      aroundLimitTaken_ = true;
+    }
+    return size;
+  }
+
+ private:
+  bool aroundLimitTaken_ = false;
+};
+
+// Keys of large dictionaries differ in length, so that the lookups of MessageDict::set, which
+// are what makes filling one quadratic, compare sizes rather than bytes.
+inline std::string largeKey(std::size_t index) {
+  return std::string(index + 1, 'k');
 }
 
 }  // namespace halvex::fuzz

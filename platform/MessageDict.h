@@ -37,8 +37,8 @@ class MessageDict {
   std::string getString(std::string_view key, std::string_view fallback = {}) const;
 
   bool contains(std::string_view key) const { return get(key) != nullptr; }
-  std::size_t size() const { return entries_.size(); }
-  bool empty() const { return entries_.empty(); }
+  std::size_t size() const;
+  bool empty() const;
   const std::vector<Entry>& entries() const { return entries_; }
 
   friend bool operator==(const MessageDict& a, const MessageDict& b);
@@ -84,6 +84,15 @@ class MessageValue {
   // The alternatives' order matches Kind.
   std::variant<std::monostate, std::string, std::int64_t, bool, MessageDict> storage_;
 };
+
+// Defined here rather than in the class: sizing the vector needs Entry, and with it MessageValue,
+// to be complete.
+inline std::size_t MessageDict::size() const {
+  return entries_.size();
+}
+inline bool MessageDict::empty() const {
+  return entries_.empty();
+}
 
 // A readable one-line rendering, for logs and test failure messages.
 std::string describe(const MessageValue& value);

@@ -1,15 +1,16 @@
 #!/usr/bin/env bash
 # SPDX-License-Identifier: MIT
 # The whole test suite on a fresh Debian 12 machine: installs what is missing, then configures,
-# builds and runs every test under the plain, AddressSanitizer+UBSan and ThreadSanitizer presets.
-# Arguments, if any, name the presets to run instead of all three.
+# builds and runs every test under the plain (GCC), AddressSanitizer+UBSan, ThreadSanitizer and
+# clang presets, and last the fuzz preset, whose tests run each fuzz target over its seed corpus
+# for a few seconds. Arguments, if any, name the presets to run instead of all five.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/packages.sh
 ensure_packages
 
 presets=("$@")
-((${#presets[@]})) || presets=(dev asan tsan)
+((${#presets[@]})) || presets=(dev asan tsan clang fuzz)
 jobs=$(nproc)
 
 for preset in "${presets[@]}"; do

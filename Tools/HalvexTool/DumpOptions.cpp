@@ -48,18 +48,21 @@ constexpr std::array<NamedValue, 8> kNamedValues{{
 void parseDumpOptions(std::vector<std::string>& words, bool& compress, std::string& reason,
                       bool& nonui) {
   reason = kDefaultReason;
-  while (!words.empty()) {
-    std::string word = std::move(words.front());
-    words.erase(words.begin());
+  // The consumed words go in one erase at the end: erasing them one at a time would move every
+  // later word once per word consumed.
+  auto next = words.begin();
+  while (next != words.end()) {
+    const std::string& word = *next++;
     if (word == "nocompress") {
       compress = false;
     } else if (word == "nonui") {
       nonui = true;
     } else {
       reason = kReasonPrefix + word;
-      return;
+      break;
     }
   }
+  words.erase(words.begin(), next);
 }
 
 bool parseTraceValue(const std::string& text, std::int32_t& value) {

@@ -190,6 +190,13 @@ std::vector<LogLine> FakePlatform::logLines() const {
   return impl_->logLines;
 }
 
+void FakePlatform::clearRequests() {
+  std::lock_guard lock(impl_->mutex);
+  impl_->serverRequests.clear();
+  impl_->helperRequests.clear();
+  impl_->logLines.clear();
+}
+
 }  // namespace halvex::fake
 
 // The platform interfaces, answered by the fake.

@@ -111,6 +111,10 @@ class FakePlatform {
 
   std::vector<LogLine> logLines() const;
 
+  // Forgets the server and helper requests and the log lines recorded so far, as clearCalls()
+  // does the calls, so that a long run (a fuzzer's) does not keep every one.
+  void clearRequests();
+
   // Used by the fake services themselves.
   struct Impl;
   Impl& impl();

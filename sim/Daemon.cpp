@@ -726,11 +726,13 @@ int Daemon::Impl::onSubscribe(sd_bus_message* call, void* userdata, sd_bus_error
     if (r < 0)
       return r;
 
-    const bool inReply = state && state->when == StateWhen::kSubscribe;
-    impl->server.journal.log(
-        LogLevel::kInfo,
-        std::string("Subscribe from ") + client + ": " +
-            (inReply ? "the state event " + describe(state->payload) : std::string("no event")));
+    std::string events = "no event";
+    if (state && state->when == StateWhen::kSubscribe)
+      events = "the state event " + describe(state->payload);
+    if (state && state->when == StateWhen::kAfter)
+      events = "the state event to follow in " + std::to_string(state->afterMs) + " ms";
+    impl->server.journal.log(LogLevel::kInfo,
+                             std::string("Subscribe from ") + client + ": " + events);
     if (state && state->when == StateWhen::kAfter) {
       impl->defer(&impl->server, state->afterMs, [impl](Deferred&) {
         impl->emitEvent(kEventServerStateChange, impl->scenario.server.state->payload);

@@ -29,8 +29,6 @@ constexpr std::uint32_t kMaxDelayMs = 24 * 60 * 60 * 1000;
 constexpr std::size_t kMaxProcesses = 64;
 constexpr std::size_t kMaxProcessName = 255;  // one file name: the keeper links it in a folder
 
-// A JSON pointer token, with control characters (NUL and newline among them) written as \u00XX
-// so that a message naming the place stays one printable line.
 std::string escapePointerToken(std::string_view token) {
   std::string out;
   for (const char c : token) {
@@ -38,7 +36,19 @@ std::string escapePointerToken(std::string_view token) {
       out += "~0";
     } else if (c == '/') {
       out += "~1";
-    } else if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f) {
+    } else {
+      out += c;
+    }
+  }
+  return out;
+}
+
+// Control characters (NUL and newline among them, from keys and words the scenario wrote) as
+// \u00XX, so that a message stays one printable line.
+std::string printable(std::string_view text) {
+  std::string out;
+  for (const char c : text) {
+    if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f) {
       char escaped[8];
       std::snprintf(escaped, sizeof escaped, "\\u%04x", static_cast<unsigned char>(c));
       out += escaped;
@@ -400,18 +410,26 @@ std::string parseErrorReason(const std::string& what) {
 // Builds the document from the parser's events rather than letting the library build it, so that
 // what is known only while reading comes with a place: where a number overflows, an integer too
 // long for 64 bits (which the library would silently turn into a fraction), nesting too deep.
+// A place given as a JSON pointer always exists in the document; one in text that turns out not
+// to be JSON, or that the library cannot hold, is reported at the top level.
 class DocumentReader final : public nlohmann::json_sax<Json> {
  public:
   explicit DocumentReader(std::string_view text) : text_(text) {}
-  Json& document() { return document_; }
+  // The document, once the whole text has been read.
+  const Json& document() const {
+    if (tooLong_)
+      throw *tooLong_;
+    return document_;
+  }
 
   bool null() override { return add(nullptr); }
   bool boolean(bool value) override { return add(value); }
   bool number_integer(number_integer_t value) override { return add(value); }
   bool number_unsigned(number_unsigned_t value) override { return add(value); }
   bool number_float(number_float_t value, const string_t& text) override {
-    if (text.find_first_of(".eE") == string_t::npos)
-      fail(place(), text + " is out of range (beyond 64 bits)");
+    // Reported once the rest of the text has proven to be JSON.
+    if (text.find_first_of(".eE") == string_t::npos && !tooLong_)
+      tooLong_.emplace(place(), text + " is out of range (beyond 64 bits)");
     return add(value);
   }
   bool string(string_t& value) override { return add(std::move(value)); }
@@ -426,10 +444,11 @@ class DocumentReader final : public nlohmann::json_sax<Json> {
   bool end_array() override { return close(); }
   bool parse_error(std::size_t byte, const std::string& token,
                    const nlohmann::detail::exception& error) override {
+    const std::string at = parseErrorPlace(text_, byte);
     // 406: a number too large for a double; it is complete, so its place is known.
     if (error.id == 406)
-      fail(place(), token + " is out of range");
-    fail("", "not valid JSON at " + parseErrorPlace(text_, byte) + parseErrorReason(error.what()));
+      fail("", token + " at " + place() + " is out of range (" + at + ")");
+    fail("", "not valid JSON at " + at + parseErrorReason(error.what()));
   }
 
  private:
@@ -472,7 +491,7 @@ class DocumentReader final : public nlohmann::json_sax<Json> {
   }
   bool open(Json container) {
     if (open_.size() >= kMaxJsonDepth) {
-      fail(place(), "nested deeper than " + std::to_string(kMaxJsonDepth) + " levels");
+      fail("", "nested deeper than " + std::to_string(kMaxJsonDepth) + " levels at " + place());
     }
     open_.push_back({&insert(std::move(container)), {}});
     return true;
@@ -485,12 +504,14 @@ class DocumentReader final : public nlohmann::json_sax<Json> {
   std::string_view text_;
   Json document_;
   std::vector<Open> open_;
+  std::optional<ScenarioError> tooLong_;
 };
 
 }  // namespace
 
 ScenarioError::ScenarioError(std::string pointer, std::string problem)
-    : std::runtime_error((pointer.empty() ? std::string("(top level)") : pointer) + ": " + problem),
+    : std::runtime_error(
+          printable((pointer.empty() ? std::string("(top level)") : pointer) + ": " + problem)),
       pointer_(std::move(pointer)),
       problem_(std::move(problem)) {}
 

@@ -1,10 +1,9 @@
 // SPDX-License-Identifier: MIT
-// The fixtures the bus and end-to-end tests stand on: if these lie, every test above them does.
+// The process runner the command-line and end-to-end tests stand on: if it lies, every test above
+// it does. The private bus is exercised by every bus test.
 #include <gtest/gtest.h>
 
-#include <cstdlib>
-
-#include "tests/support/TestBus.h"
+#include "tests/support/Subprocess.h"
 
 namespace halvex::test {
 namespace {
@@ -38,19 +37,6 @@ TEST(RunProcess, PassesInputAndEnvironmentCollectsBothStreamsAndNeverHangs) {
     EXPECT_EQ(result.status.describe() + "|" + result.out + "|" + result.err, c.expected);
   }
   EXPECT_THROW(runProcess({{"/nonexistent/program"}, {}, {}}), std::runtime_error);
-}
-
-TEST(PrivateBus, PointsTheSystemBusAtAPrivateDaemonAndStops) {
-  PrivateBus bus;
-  ASSERT_NE(std::getenv("DBUS_SYSTEM_BUS_ADDRESS"), nullptr);
-  EXPECT_EQ(bus.address(), std::getenv("DBUS_SYSTEM_BUS_ADDRESS"));
-  RunResult names = bus.busctl({"list", "--no-legend"});
-  EXPECT_EQ(names.status.describe(), "exit 0") << names.err;
-  EXPECT_NE(names.out.find("org.freedesktop.DBus"), std::string::npos) << names.out;
-
-  bus.stop();
-  names = bus.busctl({"list", "--no-legend"});
-  EXPECT_NE(names.status.code, 0);
 }
 
 }  // namespace

@@ -29,11 +29,9 @@ void TaskGroup::leave() const {
     std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
     std::abort();
   }
-  const bool drained = --state_->count == 0;
-  lock.unlock();
-  // Outside the lock, so that a woken waiter does not block on it at once. This handle keeps the
-  // state alive meanwhile.
-  if (drained) {
+  // Under the lock: a waiter that wakes may destroy the group at once, and this handle may be
+  // nothing but a reference to the waiter's own.
+  if (--state_->count == 0) {
     state_->drained.notify_all();
   }
 }

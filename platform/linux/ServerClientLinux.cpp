@@ -212,8 +212,11 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore>,
     hub_->close();
     auto done = std::make_shared<std::promise<void>>();
     std::future<void> finished = done->get_future();
-    ProcessBus::instance().post([self = shared_from_this(), done] {
+    // The closure lets go of the core before it reports, so that the core goes with the
+    // Manager, on the caller's thread, together with its queue handle.
+    ProcessBus::instance().post([self = shared_from_this(), done]() mutable {
       self->closeOnBus();
+      self.reset();
       done->set_value();
     });
     finished.wait();

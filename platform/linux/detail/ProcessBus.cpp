@@ -264,6 +264,9 @@ void ProcessBus::drainInbox() {
   }
   for (Task& task : batch) {
     task();
+    // Released at once, not with the batch: what a task holds may have to go before the next
+    // task runs (a manager's shutdown hands back its last reference this way).
+    task = nullptr;
   }
 }
 

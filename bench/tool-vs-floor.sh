@@ -59,7 +59,8 @@ if ! read -r -t 10 line <"${work}/ready" || [[ ${line} != ready ]]; then
   exit 1
 fi
 
-if ! "${tool}" logdump tel | grep -q '^Telephony log collection: Success$'; then
+if ! "${tool}" logdump tel >"${work}/first.out" 2>&1 ||
+  ! grep -q '^Telephony log collection: Success$' "${work}/first.out"; then
   echo "halvextool logdump tel does not succeed here; nothing to measure" >&2
   exit 1
 fi
@@ -92,7 +93,7 @@ rss_tool=$(peak "${tool}" logdump tel)
 
 # Interactive throughput: the same lines through the tool and through the bare client. A run of
 # one line is taken off each, so that start-up and the 500 ms wait drop out.
-yes 'logdump tel' | head -n "${lines}" >"${work}/lines"
+for ((i = 0; i < lines; i++)); do echo 'logdump tel'; done >"${work}/lines"
 echo 'logdump tel' >"${work}/one"
 lines_usec() {
   local many one
@@ -115,7 +116,7 @@ printf '%s\n' "${r_tool[@]}" >"${work}/tool_lines"
 stats() {  # FILE OFFSET_USEC -> "median min max" in ms
   sort -n "$1" | awk -v off="$2" '{ v[NR] = ($1 - off) / 1000 }
     END { m = (NR % 2) ? v[(NR + 1) / 2] : (v[NR / 2] + v[NR / 2 + 1]) / 2
-          printf "%.2f %.2f %.2f", m, v[1], v[NR] }'
+          printf "%.2f %.2f %.2f\n", m, v[1], v[NR] }'
 }
 read -r triv_med triv_min triv_max < <(stats "${work}/trivial" 0)
 read -r floor_med floor_min floor_max < <(stats "${work}/floor" 500000)

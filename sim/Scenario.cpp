@@ -467,7 +467,8 @@ class DocumentReader final : public nlohmann::json_sax<Json> {
         pointer = child(pointer, o.key);
       } else {
         const std::size_t size = o.container->size();
-        pointer += "/" + std::to_string(i + 1 == open_.size() ? size : size - 1);
+        pointer += '/';
+        pointer += std::to_string(i + 1 == open_.size() ? size : size - 1);
       }
     }
     return pointer;

@@ -232,7 +232,7 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore>,
     }
     auto call = std::make_shared<CommandCall>(
         CommandCall{std::move(command), std::move(request), std::move(done)});
-    ProcessBus::instance().post([self = shared_from_this(), call] { self->startCommand(call); });
+    ProcessBus::instance().send([self = shared_from_this(), call] { self->startCommand(call); });
   }
 
   Result performSync(const std::string& command, const MessageDict& request, MessageValue& reply) {

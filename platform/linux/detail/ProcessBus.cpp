@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: MIT
 #include "platform/linux/detail/ProcessBus.h"
 
+#include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <unistd.h>
@@ -25,6 +26,8 @@ constexpr std::uint64_t kExpiryAccuracyUsec = 1000;
 // True on the thread that is the I/O context right now: the loop's, or a direct user's while it
 // holds the bus's lock. Work it posts runs at once, and it must not wait for itself.
 thread_local bool tIoContext = false;
+// True while a caller borrows the connection from a sleeping loop: sd-bus is ours, sd-event not.
+thread_local bool tBorrowed = false;
 
 class IoScope {
  public:
@@ -108,15 +111,24 @@ int ProcessBus::run(const std::function<void()>& claimed) {
   if (claimed) {
     claimed();
   }
+  // sd_event_loop() by hand, so that the lock is held for everything but the wait itself: while
+  // the loop sleeps in epoll, a caller may borrow the connection to send (see borrow()).
+  std::unique_lock io(ioMutex_);
+  IoScope scope;
   int r = 0;
-  {
-    IoScope scope;
-    r = sd_event_loop(event_);
+  while (r >= 0 && sd_event_get_state(event_) != SD_EVENT_FINISHED) {
+    r = sd_event_prepare(event_);
+    if (r == 0) {
+      io.unlock();
+      r = sd_event_wait(event_, UINT64_MAX);
+      io.lock();
+    }
+    if (r > 0) {
+      r = sd_event_dispatch(event_);
+    }
   }
   // Hand the bus back. Direct users wait on the lock until every queued closure and pending call
   // has finished, so that nothing sent through the loop is left without its completion.
-  std::lock_guard io(ioMutex_);
-  IoScope scope;
   {
     std::lock_guard inbox(inboxMutex_);
     inboxOpen_ = false;
@@ -183,6 +195,35 @@ void ProcessBus::post(Task task) {
   }
 }
 
+bool ProcessBus::borrow(const Task& send) {
+  bool wakeLoop = false;
+  {
+    std::lock_guard io(ioMutex_);
+    // Only a call on an open connection: anything that would touch the loop itself (a new
+    // connection to attach, a timer to move) is the loop's own work.
+    if (!claimed_ || closing_ || bus_ == nullptr || sd_bus_is_ready(bus_) <= 0) {
+      return false;
+    }
+    IoScope scope;
+    tBorrowed = true;
+    send();
+    tBorrowed = false;
+    // The loop sleeps with the events it computed before: a message left queued needs it to
+    // wait for POLLOUT, and an earlier deadline needs its timer moved.
+    wakeLoop = rearmWanted_ || (bus_ != nullptr && (sd_bus_get_events(bus_) & POLLOUT) != 0);
+  }
+  if (wakeLoop) {
+    wake();
+  }
+  return true;
+}
+
+void ProcessBus::send(Task task) {
+  if (!borrow(task)) {
+    post(std::move(task));
+  }
+}
+
 Result ProcessBus::call(const CallSpec& spec, const MessageBuilder& build, const Decoder& decode) {
   if (tIoContext) {
     return makeResult(kResultBusError, "synchronous call from the bus's own context");
@@ -202,7 +243,7 @@ Result ProcessBus::call(const CallSpec& spec, const MessageBuilder& build, const
     });
   };
   for (;;) {
-    if (enqueue(send)) {
+    if (borrow(send) || enqueue(send)) {
       outcome->done.wait(false, std::memory_order_acquire);
       return outcome->result;
     }
@@ -252,7 +293,12 @@ void ProcessBus::wake() {
 int ProcessBus::onWake(sd_event_source*, int fd, std::uint32_t, void* userdata) {
   std::uint64_t count = 0;
   [[maybe_unused]] ssize_t got = read(fd, &count, sizeof count);
-  static_cast<ProcessBus*>(userdata)->drainInbox();
+  auto* self = static_cast<ProcessBus*>(userdata);
+  self->drainInbox();
+  if (self->rearmWanted_) {
+    self->rearmWanted_ = false;
+    self->armExpiry(self->earliestDeadline());
+  }
   return 0;
 }
 
@@ -461,6 +507,10 @@ void ProcessBus::armExpiry(std::uint64_t deadline) {
   // The timer is only ever moved earlier here; when it fires it finds the next deadline itself,
   // so a steady stream of calls that answer in time re-arms nothing.
   if (event_ == nullptr || (armedDeadline_ != 0 && armedDeadline_ <= deadline)) {
+    return;
+  }
+  if (tBorrowed) {
+    rearmWanted_ = true;
     return;
   }
   int r = 0;

@@ -6,11 +6,13 @@
 // tool would otherwise pay once per service.
 //
 // sd-bus objects are not thread-safe, so exactly one context touches the connection at a time:
-// the I/O context. Until some thread calls run(), the I/O context is whichever thread holds the
-// bus's lock: work posted then runs at once on the posting thread, and a synchronous call pumps
-// the connection itself (the tool's start-up checks run this way, before main enters the loop).
-// From run() on, the I/O context is the loop's thread alone, and other threads only queue
-// closures for it.
+// the I/O context, and it holds the bus's lock. Until some thread calls run(), that is whichever
+// thread takes the lock: work posted then runs at once on the posting thread, and a synchronous
+// call pumps the connection itself (the tool's start-up checks run this way, before main enters
+// the loop). From run() on, it is the loop's thread, which lets go of the lock only while it
+// sleeps in epoll: other threads queue closures for it, except that a request may be sent by its
+// caller meanwhile (send(), call()), sparing two thread hand-offs; its reply still comes through
+// the loop. Nothing but the loop's thread ever touches the sd-event loop.
 //
 // Calls carry their own time-outs (CallBounds.h) and are logged to the system log with their
 // outcome and duration; sd-bus's default time-out, which the environment can change, plays no
@@ -88,6 +90,11 @@ class ProcessBus {
   // the loop's thread in the order posted.
   void post(Task task);
 
+  // Any thread but the loop's: runs task in the I/O context, on this thread when the loop sleeps
+  // and the connection is open (the task may then only send calls on it), else as post() does.
+  // For the hot path of sending a request: no hand-off when the loop has nothing else to do.
+  void send(Task task);
+
   // Any thread but the loop's: sends the call and blocks until it completes. decode runs on the
   // method return in the I/O context; its Result is returned. Failures come back as Results.
   Result call(const CallSpec& spec, const MessageBuilder& build, const Decoder& decode);
@@ -130,6 +137,8 @@ class ProcessBus {
   void tearDownEvent();
   // Queues task for the loop; false, leaving task alone, when no loop takes work.
   bool enqueue(Task& task);
+  // Runs send on this thread as the I/O context while the loop sleeps; false when it cannot.
+  bool borrow(const Task& send);
   void wake();
   void drainInbox();
   // Direct use: serves the connection on this thread until done is set.
@@ -150,8 +159,8 @@ class ProcessBus {
 
   const std::shared_ptr<LogServer> log_;
 
-  // Held by the direct user while no loop runs, and by run() while it claims or hands back the
-  // bus.
+  // Held by whoever is the I/O context: the loop for all but its wait in epoll, a caller that
+  // borrows the connection meanwhile, or the direct user while no loop runs.
   std::mutex ioMutex_;
   bool claimed_ = false;  // a loop serves the bus (ioMutex_)
 
@@ -170,6 +179,7 @@ class ProcessBus {
   std::uint64_t epoch_ = 0;
   std::uint64_t nextCallId_ = 0;
   std::uint64_t armedDeadline_ = 0;  // 0: the expiry timer is off
+  bool rearmWanted_ = false;         // a borrower set an earlier deadline than the timer's
   std::map<std::uint64_t, std::unique_ptr<Pending>> pending_;
   std::vector<std::weak_ptr<ConnectionListener>> listeners_;
   Result lastOpenFailure_;

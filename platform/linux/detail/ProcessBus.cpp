@@ -28,6 +28,8 @@ constexpr std::uint64_t kExpiryAccuracyUsec = 1000;
 thread_local bool tIoContext = false;
 // True while a caller borrows the connection from a sleeping loop: sd-bus is ours, sd-event not.
 thread_local bool tBorrowed = false;
+// Set by a borrower's call that found the connection broken: the loop must send it instead.
+thread_local bool tBorrowAbandoned = false;
 
 class IoScope {
  public:
@@ -208,6 +210,9 @@ bool ProcessBus::borrow(const Task& send) {
     tBorrowed = true;
     send();
     tBorrowed = false;
+    if (std::exchange(tBorrowAbandoned, false)) {
+      return false;
+    }
     // The loop sleeps with the events it computed before: a message left queued needs it to
     // wait for POLLOUT, and an earlier deadline needs its timer moved.
     wakeLoop = rearmWanted_ || (bus_ != nullptr && (sd_bus_get_events(bus_) & POLLOUT) != 0);
@@ -391,38 +396,52 @@ void ProcessBus::callAsync(const CallSpec& spec, const MessageBuilder& build, Re
   pending->label = spec.label;
   pending->done = std::move(done);
 
-  sd_bus* bus = connection();
-  if (bus == nullptr) {
-    complete(std::move(pending), lastOpenFailure_, nullptr);
-    return;
-  }
-  sd_bus_message* raw = nullptr;
-  int r = sd_bus_message_new_method_call(bus, &raw, spec.destination, spec.path, spec.interface,
-                                         spec.member);
-  if (r < 0) {
-    complete(std::move(pending), resultFromErrno(bus, r), nullptr);
-    return;
-  }
-  MessagePtr message(raw);
-  r = sd_bus_message_set_auto_start(message.get(), 0);
-  if (r < 0) {
-    complete(std::move(pending), resultFromErrno(bus, r), nullptr);
-    return;
-  }
-  r = build ? build(message.get()) : 0;
-  if (r < 0) {
-    complete(std::move(pending),
-             makeResult(kResultInvalidRequest,
-                        std::string("request cannot be encoded: ") + std::strerror(-r)),
-             nullptr);
-    return;
-  }
-  // No time-out of sd-bus's own (UINT64_MAX): the deadline above is the only one.
-  r = sd_bus_call_async(bus, &pending->slot, message.get(), &ProcessBus::onReply, pending.get(),
-                        UINT64_MAX);
-  if (r < 0) {
-    complete(std::move(pending), resultFromErrno(bus, r), nullptr);
-    return;
+  // A connection can break without our noticing until we write to it. A request that fails to
+  // go out for that reason reached no one, so it goes once more on a fresh connection, which
+  // tells whether there is a bus at all. A borrower may not open connections: it leaves the
+  // request to the loop.
+  for (bool retried = false;; retried = true) {
+    sd_bus* bus = connection();
+    if (bus == nullptr) {
+      complete(std::move(pending), lastOpenFailure_, nullptr);
+      return;
+    }
+    sd_bus_message* raw = nullptr;
+    int r = sd_bus_message_new_method_call(bus, &raw, spec.destination, spec.path, spec.interface,
+                                           spec.member);
+    if (r < 0) {
+      complete(std::move(pending), resultFromErrno(bus, r), nullptr);
+      return;
+    }
+    MessagePtr message(raw);
+    r = sd_bus_message_set_auto_start(message.get(), 0);
+    if (r < 0) {
+      complete(std::move(pending), resultFromErrno(bus, r), nullptr);
+      return;
+    }
+    r = build ? build(message.get()) : 0;
+    if (r < 0) {
+      complete(std::move(pending),
+               makeResult(kResultInvalidRequest,
+                          std::string("request cannot be encoded: ") + std::strerror(-r)),
+               nullptr);
+      return;
+    }
+    // No time-out of sd-bus's own (UINT64_MAX): the deadline above is the only one.
+    r = sd_bus_call_async(bus, &pending->slot, message.get(), &ProcessBus::onReply, pending.get(),
+                          UINT64_MAX);
+    if (r >= 0) {
+      break;
+    }
+    if (sd_bus_is_open(bus) > 0 || retried) {
+      complete(std::move(pending), resultFromErrno(bus, r), nullptr);
+      return;
+    }
+    if (tBorrowed) {
+      tBorrowAbandoned = true;
+      return;
+    }
+    dropConnection("connection lost");
   }
   pending->id = ++nextCallId_;
   armExpiry(pending->deadline);

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: MIT
-// What the simulator writes for a person to find from the tool's "Path = ..." line, and the
-// request log's form of a request.
+// What the simulator writes for a person to find from the tool's "Path = ..." line (the writing
+// itself shows on the bus, in SimBusTest).
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -9,7 +9,6 @@
 #include "halvex/trace/LogLocations.h"
 #include "platform/ServerProtocol.h"
 #include "sim/LogSetWriter.h"
-#include "sim/RequestLog.h"
 #include "tests/support/TestBus.h"
 
 namespace halvex::sim {
@@ -74,30 +73,6 @@ TEST(LogSetPaths, FollowTheFormTheToolPrints) {
   EXPECT_EQ(logSetForHelper("T1", 2).written, kBase + "-diag");
 }
 
-TEST(LogSetWriter, WritesARealPackageAndFolders) {
-  halvex::test::TempDir root;
-  const LogSetWriter writer(root.path().string());
-  ASSERT_TRUE(writer.prepare());
-  EXPECT_TRUE(fs::is_regular_file(root.path() /
-                                  "var/wireless/Library/Logs/Halvex/DIAG.scratch/summary.txt"));
-
-  ASSERT_TRUE(writer.write({kBase + ".tar.gz", kBase + ".tar.gz", true}, "a package"));
-  const std::string package = root.path().string() + kBase + ".tar.gz";
-  const auto listing = halvex::test::runProcess({{"/usr/bin/tar", "tzf", package}, {}, {}});
-  EXPECT_EQ(listing.status.describe(), "exit 0") << listing.err;
-  EXPECT_NE(listing.out.find("log-bb-T1/summary.txt\n"), std::string::npos) << listing.out;
-  // Nothing but the package is left beside it.
-  int entries = 0;
-  for ([[maybe_unused]] const auto& e : fs::directory_iterator(fs::path(package).parent_path())) {
-    ++entries;
-  }
-  EXPECT_EQ(entries, 1);
-
-  ASSERT_TRUE(writer.write({kBase + "-*", kBase + "-tel", false}, "a folder"));
-  EXPECT_TRUE(fs::is_regular_file(root.path().string() + kBase + "-tel/summary.txt"));
-  EXPECT_TRUE(fs::is_regular_file(root.path().string() + kBase + "-tel/baseband.log"));
-}
-
 TEST(LogSetWriter, RefusesATimestampThatLeavesTheSnapshotFolder) {
   halvex::test::TempDir root;
   const LogSetWriter writer((root.path() / "device").string());
@@ -105,21 +80,6 @@ TEST(LogSetWriter, RefusesATimestampThatLeavesTheSnapshotFolder) {
   EXPECT_FALSE(writer.write(escape, ""));
   EXPECT_FALSE(fs::exists(root.path() / "escaped-bb-trace"));
   EXPECT_FALSE(fs::exists(root.path() / "device/var/wireless/Library/Logs/escaped-bb-trace"));
-}
-
-TEST(RequestLog, DescribesKeysInOrderWithTypesAndNesting) {
-  MessageDict inner;
-  inner.set("Depth", MessageValue::int64(-2));
-  MessageDict request;
-  request.set("Z", MessageValue::string("last?"));
-  request.set("A", MessageValue::boolean(false));
-  request.set("N", MessageValue::null());
-  request.set("D", MessageValue::dict(inner));
-  EXPECT_EQ(describeKeys(request).dump(),
-            R"([{"key":"Z","type":"string","value":"last?"},)"
-            R"({"key":"A","type":"bool","value":false},)"
-            R"({"key":"N","type":"null","value":null},)"
-            R"({"key":"D","type":"dict","value":[{"key":"Depth","type":"int64","value":-2}]}])");
 }
 
 }  // namespace

@@ -1,90 +1,14 @@
 // SPDX-License-Identifier: MIT
-// Scenario parsing without a bus: defaults, overrides, and a precise place for every mistake.
+// Scenario parsing: a precise place for every mistake. What an accepted scenario does shows on
+// the bus (SimBusTest).
 #include <gtest/gtest.h>
 
 #include <filesystem>
 
-#include "platform/ServerProtocol.h"
 #include "sim/Scenario.h"
 
 namespace halvex::sim {
 namespace {
-
-TEST(Scenario, EmptyDocumentIsAWorkingDevice) {
-  const Scenario scenario = parseScenario("{}");
-  EXPECT_TRUE(scenario.device.present);
-  EXPECT_EQ(scenario.device.radioType, 1);
-  EXPECT_EQ(scenario.device.radioVendor, 2);
-  EXPECT_TRUE(scenario.device.internalBuild);
-  EXPECT_FALSE(scenario.device.carrierBuild);
-  EXPECT_TRUE(scenario.device.traceAllowed);
-  EXPECT_TRUE(scenario.processes.empty());
-  EXPECT_TRUE(scenario.server.present);
-  ASSERT_TRUE(scenario.server.state.has_value());
-  EXPECT_EQ(describe(scenario.server.state->payload), R"({"ServerState": "Started"})");
-  EXPECT_EQ(scenario.server.state->when, StateWhen::kSubscribe);
-  EXPECT_EQ(scenario.server.propertyAnswer(kTraceBaseband, kKeyTraceEnabled).value, "1");
-  EXPECT_EQ(scenario.server.propertyAnswer(kTraceSystemLogs, kKeyTraceMode).value, "0");
-  EXPECT_FALSE(scenario.server.propertyAnswer(kTraceBaseband, "Other").value.has_value());
-  const Answer dump = scenario.server.commandAnswer(kCommandTraceDumpState);
-  EXPECT_EQ(dump.result, 0);
-  EXPECT_EQ(dump.reply, ReplyKind::kDict);
-  EXPECT_EQ(dump.fault, Fault::kNone);
-  EXPECT_EQ(dump.stamp, Stamp::kDefault);
-  EXPECT_TRUE(scenario.helper.present);
-  EXPECT_FALSE(parseScenario(R"({"server": {"state": null}})").server.state.has_value());
-}
-
-TEST(Scenario, OverridesLandWhereWritten) {
-  const Scenario scenario = parseScenario(R"({
-    "device": {"present": false, "radio_vendor": 1, "carrier_build": true},
-    "processes": ["Telvane", "A process name longer than fifteen"],
-    "server": {
-      "appear_after_ms": 250,
-      "state": {"payload": {"Z": 1, "A": {"nested": true}, "M": null}, "when": "after", "after_ms": 40},
-      "commands": {"TraceDumpState": {"result": 3760250881, "reply": "string", "timestamp": "T1",
-                                      "delay_ms": 100, "fault": "never_answer"},
-                   "Other": {"result": -5, "fault": "exit", "timestamp": null}},
-      "properties": {"BasebandTrace": {"Enabled": {"result": 7, "reply": "null"}}}
-    },
-    "helper": {"present": false, "reply": "bool", "timestamp": "H1"}
-  })");
-  EXPECT_FALSE(scenario.device.present);
-  EXPECT_EQ(scenario.device.radioVendor, 1);
-  EXPECT_TRUE(scenario.device.carrierBuild);
-  EXPECT_TRUE(scenario.device.internalBuild);
-  EXPECT_EQ(scenario.processes,
-            (std::vector<std::string>{"Telvane", "A process name longer than fifteen"}));
-  EXPECT_EQ(scenario.server.appearAfterMs, 250U);
-  ASSERT_TRUE(scenario.server.state.has_value());
-  EXPECT_EQ(scenario.server.state->when, StateWhen::kAfter);
-  EXPECT_EQ(scenario.server.state->afterMs, 40U);
-  // Payload keys keep the order written: that is the order they travel in.
-  EXPECT_EQ(describe(scenario.server.state->payload),
-            R"({"Z": 1, "A": {"nested": true}, "M": null})");
-
-  const Answer dump = scenario.server.commandAnswer(kCommandTraceDumpState);
-  EXPECT_EQ(static_cast<std::uint32_t>(dump.result), 0xE020E001U);
-  EXPECT_EQ(dump.reply, ReplyKind::kString);
-  EXPECT_EQ(dump.stamp, Stamp::kText);
-  EXPECT_EQ(dump.timestamp, "T1");
-  EXPECT_EQ(dump.delayMs, 100U);
-  EXPECT_EQ(dump.fault, Fault::kNeverAnswer);
-  EXPECT_EQ(scenario.server.commandAnswer("Other").result, -5);
-  EXPECT_EQ(scenario.server.commandAnswer("Other").fault, Fault::kExit);
-  EXPECT_EQ(scenario.server.commandAnswer("Other").stamp, Stamp::kNone);
-
-  // A listed pair replaces its default entirely; the other default stays.
-  const PropertyAnswer enabled = scenario.server.propertyAnswer(kTraceBaseband, kKeyTraceEnabled);
-  EXPECT_FALSE(enabled.value.has_value());
-  EXPECT_EQ(enabled.answer.result, 7);
-  EXPECT_EQ(enabled.answer.reply, ReplyKind::kNull);
-  EXPECT_EQ(scenario.server.propertyAnswer(kTraceSystemLogs, kKeyTraceMode).value, "0");
-
-  EXPECT_FALSE(scenario.helper.present);
-  EXPECT_EQ(scenario.helper.status.reply, ReplyKind::kBool);
-  EXPECT_EQ(scenario.helper.status.timestamp, "H1");
-}
 
 std::string repeat(const std::string& text, int times) {
   std::string out;
@@ -126,29 +50,20 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
       {R"({"device": {"radio_type": 18446744073709551616}, })", "", "not valid JSON"},
       {R"({"device": {"radio_type": 18446744073709551616}})", "/device/radio_type",
        "beyond 64 bits"},
-      {R"({"processes": ["a", -99999999999999999999]})", "/processes/1", "beyond 64 bits"},
       {R"({"server": {"state": {"payload": {"k": "a\u0000"}}}})", "/server/state/payload/k",
        "holds NUL"},
       {R"({"server": {"state": {"payload": {"a\u0000\n": 1}}}})",
        "/server/state/payload/a" + std::string(1, '\0') + "\n",
        "payload/a\\u0000\\u000a: this key holds NUL"},
       {R"({"helper": {"timestamp": "\uFDD0"}})", "/helper/timestamp", "noncharacter"},
-      {R"({"server": {"properties": {"T": {"P": {"value": "\uFFFF"}}}}})",
-       "/server/properties/T/P/value", "noncharacter"},
       {R"({"bogus": 1})", "/bogus", "unknown key"},
       {R"({"device": {"radio_type": "1"}})", "/device/radio_type",
        "expected an integer, got a string"},
       {R"({"device": {"present": 1}})", "/device/present", "expected a boolean"},
-      {R"({"device": {"colour": 1}})", "/device/colour", "unknown key"},
       {R"({"processes": "Telvane"})", "/processes", "expected an array"},
       {R"({"processes": ["ok", "a/b"]})", "/processes/1", "not a process name"},
       {R"({"processes": ["x", "x"]})", "/processes/1", "listed twice"},
-      {R"({"processes": [7]})", "/processes/0", "expected a string"},
-      {R"({"server": []})", "/server", "expected an object"},
-      {R"({"server": {"present": "yes"}})", "/server/present", "expected a boolean"},
       {R"({"server": {"appear_after_ms": -1}})", "/server/appear_after_ms", "out of range"},
-      {R"({"server": {"commands": {"TraceDumpState": {"result": "0"}}}})",
-       "/server/commands/TraceDumpState/result", "expected an integer, got a string"},
       {R"({"server": {"commands": {"TraceDumpState": {"result": 1.5}}}})",
        "/server/commands/TraceDumpState/result", "got a fractional number"},
       {R"({"server": {"commands": {"TraceDumpState": {"result": 4294967296}}}})",
@@ -157,13 +72,10 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
        "\"text\" is not one of \"dict\""},
       {R"({"server": {"commands": {"X": {"fault": true}}}})", "/server/commands/X/fault",
        "expected one of \"none\""},
-      {R"({"server": {"commands": {"X": {"delay_ms": 999999999}}}})", "/server/commands/X/delay_ms",
-       "out of range"},
       {R"({"server": {"commands": {"X": {"value": "1"}}}})", "/server/commands/X/value",
        "unknown key"},
       {R"({"server": {"commands": {"a/b~c": {"bogus": 1}}}})", "/server/commands/a~1b~0c/bogus",
        "unknown key"},
-      {R"({"server": {"commands": {"X": 0}}})", "/server/commands/X", "expected an object"},
       {R"({"server": {"commands": {"GetTraceProperty": {}}}})", "/server/commands/GetTraceProperty",
        "/server/properties"},
       {R"({"server": {"state": "Started"}})", "/server/state", "expected an object"},
@@ -176,12 +88,8 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
       {kDeepPayload, kDeepPointer, "nested deeper than 16"},
       {kWidePayload, "/server/state/payload", "more than 1024 entries"},
       {kHeavyPayload, "/server/state/payload/k16/k366", "more than 16384 values"},
-      {R"({"server": {"properties": {"BasebandTrace": 1}}})", "/server/properties/BasebandTrace",
-       "expected an object"},
       {R"({"server": {"properties": {"BasebandTrace": {"Enabled": {"value": 1}}}}})",
        "/server/properties/BasebandTrace/Enabled/value", "expected a string"},
-      {R"({"server": {"properties": {"T": {"P": {"timestamp": "x"}}}}})",
-       "/server/properties/T/P/timestamp", "unknown key"},
       {R"({"helper": {"timestamp": 5}})", "/helper/timestamp", "expected a string"},
       {R"({"helper": {"present": null}})", "/helper/present", "got null"},
   };

@@ -35,11 +35,10 @@ struct Delivery {
 
 class ManagerTest : public ::testing::Test {
  protected:
-  // Starts the simulator (unless scenario is empty), the run loop, the queue and the manager.
+  // Starts the simulator, the run loop, the queue and the manager.
   // Anything that changes the environment must come before: this is where threads start.
   void start(const std::string& scenario) {
-    if (!scenario.empty())
-      sim_.emplace(bus_, scenario);
+    sim_.emplace(bus_, scenario);
     loop_.emplace();
     queue_.emplace(WorkQueue::create("test.queue"));
     manager_ = client::CreateManager("halvextool", *queue_);
@@ -77,12 +76,12 @@ class ManagerTest : public ::testing::Test {
     return done.get_future().wait_for(kFailsafe) == std::future_status::ready;
   }
 
+  // The server states the state events told, in order.
   std::vector<std::string> states() {
     std::vector<std::string> out;
-    for (const Delivery& event : mail(kEventServerStateChange)) {
-      const MessageDict* payload = event.value.asDict();
-      out.push_back(payload ? payload->getString(kKeyServerState, "?") : describe(event.value));
-    }
+    for (const Delivery& event : mail(kEventServerStateChange))
+      out.push_back(event.value.isDict() ? event.value.asDict()->getString(kKeyServerState)
+                                         : describe(event.value));
     return out;
   }
 
@@ -124,10 +123,17 @@ MessageDict sampleRequest() {
   return request;
 }
 
-TEST_F(ManagerTest, RoundTripsDeliverRepliesOnTheQueue) {
+// Every request completes once, with its outcome: synchronously, or on the queue, even from a
+// completion; a reply whatever its code; refused before it is sent when it cannot be; timed out
+// by the platform's own bound, which not even sd-bus's "infinity" outlasts.
+TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
+  ASSERT_EQ(setenv("SYSTEMD_BUS_TIMEOUT", "infinity", 1), 0);  // read once, before any thread
+  bus::CallBounds bounds = bus::callBounds();
+  bounds.otherCommand = std::chrono::milliseconds(300);
+  bus::ScopedCallBoundsForTesting shorter(bounds);
   start(R"({"server": {"commands": {"TraceDumpState": {"timestamp": "20261122-101500"},
       "Refused": {"result": 7, "reply": "string", "timestamp": "kept"},
-      "Slow": {"delay_ms": 500}}}})");
+      "Hang": {"fault": "never_answer"}}}})");
   MessageValue reply = MessageValue::string("stale");
   Result result = client::PerformCommand(manager_, kCommandTraceDumpState, sampleRequest(), reply);
   ASSERT_TRUE(result.ok()) << result.message;
@@ -138,47 +144,41 @@ TEST_F(ManagerTest, RoundTripsDeliverRepliesOnTheQueue) {
             R"({"key":"mike","type":"int64","value":-42},)"
             R"({"key":"nested","type":"dict","value":[{"key":"b","type":"null","value":null},)"
             R"({"key":"a","type":"string","value":"inner"}]}])");
-  // The reply is handed over whatever the code; callers that need success check it.
   EXPECT_EQ(client::PerformCommand(manager_, "Refused", {}, reply).code, 7);
   EXPECT_EQ(reply, MessageValue::string("kept"));
+  MessageDict badKey;
+  badKey.set("\xff", MessageValue::null());
+  const std::pair<std::string, MessageDict> unsendable[] = {{"Bad\xff", {}},
+                                                            {std::string("Nul\0", 4), {}},
+                                                            {"", {}},
+                                                            {std::string(300, 'c'), {}},
+                                                            {"Fine", badKey}};
+  for (const auto& [command, request] : unsendable)
+    EXPECT_EQ(client::PerformCommand(manager_, command, request, reply).code,
+              kResultInvalidRequest);
+  EXPECT_EQ(sim_->requestLog().size(), 2u);
+  EXPECT_EQ(client::PerformCommand(manager_, "Hang", {}, reply).code, kResultTimeout);
 
-  // A delayed answer holds up neither the server nor the manager.
-  client::PerformCommand(manager_, "Slow", record("slow"), {});
-  EXPECT_TRUE(barrier());
-  EXPECT_TRUE(mail("slow").empty());
   client::PerformCommand(manager_, kCommandTraceDumpState, record("async"), {});
-  // A completion may itself make a synchronous call: the queue waits, the run loop does not.
+  client::PerformCommand(manager_, "Hang", record("hang"), {});
+  client::PerformCommand(manager_, "Bad\xff", record("unsendable"), {});
   client::PerformCommand(
       manager_, "Unlisted",
-      [this](Result, MessageValue) {
+      [this](Result, MessageValue) {  // the queue waits, the run loop does not
         MessageValue inner;
         add({"nested", client::PerformCommand(manager_, kCommandTraceDumpState, {}, inner), inner});
       },
       {});
-  ASSERT_TRUE(waitFor(1, "slow") && waitFor(1, "async") && waitFor(1, "nested") && drain());
-  EXPECT_EQ(mail().size(), 3u);
+  ASSERT_TRUE(waitFor(4) && drain());
+  EXPECT_EQ(mail().size(), 4u);
   for (const Delivery& done : mail()) {
     EXPECT_TRUE(done.onQueue) << done.name;
-    EXPECT_TRUE(done.result.ok()) << done.name << ": " << done.result.message;
-    EXPECT_TRUE(done.value.isDict()) << done.name;
+    EXPECT_EQ(done.value.isDict(), done.result.ok()) << done.name << ": " << done.result.message;
   }
-}
-
-TEST_F(ManagerTest, RequestsThatCannotBeSentFailLocally) {
-  start("{}");
-  MessageDict badKey;
-  badKey.set("\xff", MessageValue::null());
-  const std::pair<std::string, MessageDict> cases[] = {{"Bad\xff", {}},
-                                                       {std::string("Nul\0", 4), {}},
-                                                       {"", {}},
-                                                       {std::string(300, 'c'), {}},
-                                                       {"Fine", badKey}};
-  for (const auto& [command, request] : cases) {
-    MessageValue reply;
-    EXPECT_EQ(client::PerformCommand(manager_, command, request, reply).code,
-              kResultInvalidRequest);
-  }
-  EXPECT_TRUE(sim_->requestLog().empty());
+  EXPECT_EQ(mail("async")[0].result.code, 0);
+  EXPECT_EQ(mail("nested")[0].result.code, 0);
+  EXPECT_EQ(mail("hang")[0].result.code, kResultTimeout);
+  EXPECT_EQ(mail("unsendable")[0].result.code, kResultInvalidRequest);
 }
 
 // A server of our own that owns the server's name and misbehaves: PerformCommand "Garbage" gets a
@@ -189,24 +189,7 @@ class RogueServer {
  public:
   static constexpr int kListed = 300;
 
-  RogueServer() {
-    thread_ = std::thread([this] {
-      sd_bus* bus = nullptr;
-      bool ok = sd_bus_open_system(&bus) >= 0 &&
-                sd_bus_add_object(bus, nullptr, "/org/halvex/Server", &answer, nullptr) >= 0 &&
-                sd_bus_request_name(bus, "org.halvex.Server", 0) >= 0;
-      ready_.set_value(ok);
-      while (ok && !stop_) {
-        if (sd_bus_process(bus, nullptr) == 0)
-          sd_bus_wait(bus, 50000);
-      }
-      sd_bus_flush_close_unref(bus);
-    });
-  }
-  ~RogueServer() {
-    stop_ = true;
-    thread_.join();
-  }
+  // True once it owns the name.
   bool ready() { return ready_.get_future().get(); }
 
  private:
@@ -232,8 +215,18 @@ class RogueServer {
     return sd_bus_reply_method_return(call, "s", "garbage");
   }
   std::promise<bool> ready_;
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
+  std::jthread thread_{[this](std::stop_token stop) {
+    sd_bus* bus = nullptr;
+    bool ok = sd_bus_open_system(&bus) >= 0 &&
+              sd_bus_add_object(bus, nullptr, "/org/halvex/Server", &answer, nullptr) >= 0 &&
+              sd_bus_request_name(bus, "org.halvex.Server", 0) >= 0;
+    ready_.set_value(ok);
+    while (ok && !stop.stop_requested()) {
+      if (sd_bus_process(bus, nullptr) == 0)
+        sd_bus_wait(bus, 50000);
+    }
+    sd_bus_flush_close_unref(bus);
+  }};
 };
 
 // No server, no bus, or the bus driver's word for it: nothing else means "not running". A rogue
@@ -265,40 +258,6 @@ TEST_F(ManagerTest, OnlyTheBusDriverSaysTheServerIsNotRunning) {
   client::PerformCommand(manager_, "Any", record("async"), {});
   ASSERT_TRUE(waitFor(1, "async"));
   EXPECT_EQ(mail("async")[0].result.code, kResultServerNotRunning);
-}
-
-// The bounds are the platform's own: not even sd-bus's default of "infinity" outlasts them.
-TEST_F(ManagerTest, UnansweredCallsTimeOutWhateverTheEnvironmentSays) {
-  ASSERT_EQ(setenv("SYSTEMD_BUS_TIMEOUT", "infinity", 1), 0);  // read once, before any thread
-  bus::CallBounds bounds = bus::callBounds();
-  bounds.otherCommand = std::chrono::milliseconds(300);
-  bus::ScopedCallBoundsForTesting shorter(bounds);
-  start(R"({"server": {"commands": {"Hang": {"fault": "never_answer"}}}})");
-  MessageValue reply;
-  EXPECT_EQ(client::PerformCommand(manager_, "Hang", {}, reply).code, kResultTimeout);
-  client::PerformCommand(manager_, "Hang", record("async"), {});
-  ASSERT_TRUE(waitFor(1));
-  EXPECT_EQ(mail()[0].result.code, kResultTimeout);
-}
-
-// Losing the bus completes what is pending; nothing but the manager's own retries brings events
-// back once the bus and the server return.
-TEST_F(ManagerTest, ABusThatRestartsCompletesPendingCallsAndEventsResume) {
-  start(R"({"server": {"commands": {"Slow": {"delay_ms": 60000}}}})");
-  listen(kEventServerStateChange);
-  client::EventsOn(manager_);
-  ASSERT_TRUE(waitFor(1, kEventServerStateChange));
-  client::PerformCommand(manager_, "Slow", record("slow"), {});
-  ASSERT_TRUE(barrier());
-  bus_.restart();
-  ASSERT_TRUE(waitFor(1, "slow"));
-  EXPECT_EQ(mail("slow")[0].result.code, kResultConnectionLost);
-  ASSERT_TRUE(waitFor(2, kEventServerStateChange));
-  sim_.reset();  // it ended with the old bus
-  sim_.emplace(bus_, "{}");
-  ASSERT_TRUE(waitFor(3, kEventServerStateChange) && drain());
-  EXPECT_EQ(states(),
-            (std::vector<std::string>{kServerStateStarted, "Stopped", kServerStateStarted}));
 }
 
 TEST_F(ManagerTest, PendingCallsAreBoundedAndEachCompletesOnceWhenTheManagerGoes) {
@@ -359,13 +318,14 @@ TEST_F(ManagerTest, ManyThreadsShareOneManager) {
     EXPECT_TRUE(done.result.ok() && done.onQueue) << done.result.message;
 }
 
-// A server that comes late, reports its state late, leaves with a request unanswered, comes back
-// and dies mid-request: the manager subscribes whenever it appears, and tells of its going.
+// A server that comes late, reports its state late, leaves with a request unanswered, comes
+// back, loses its bus and dies mid-request: the manager subscribes whenever it appears, of
+// itself, and tells of its going.
 TEST_F(ManagerTest, EventsFollowTheServerComingAndGoing) {
   const auto started = std::chrono::steady_clock::now();
   start(R"({"server": {"appear_after_ms": 300,
       "state": {"when": "after", "after_ms": 100, "payload": {"ServerState": "Started"}},
-      "commands": {"Hang": {"fault": "never_answer"}, "Crash": {"fault": "exit"}}}})");
+      "commands": {"Hang": {"fault": "never_answer"}, "Slow": {"delay_ms": 60000}}}})");
   listen(kEventServerStateChange);
   client::EventsOff(manager_);
   client::EventsOn(manager_);
@@ -379,13 +339,23 @@ TEST_F(ManagerTest, EventsFollowTheServerComingAndGoing) {
   ASSERT_TRUE(waitFor(3, kEventServerStateChange));
   ASSERT_EQ(sim_->callControl("EmitState").status.code, 0);
   ASSERT_TRUE(waitFor(4, kEventServerStateChange));
+  // A delayed answer holds up neither the server nor the manager; a bus that goes completes it.
+  client::PerformCommand(manager_, "Slow", record("slow"), {});
+  ASSERT_TRUE(barrier());
+  bus_.restart();
+  ASSERT_TRUE(waitFor(1, "slow") && waitFor(5, kEventServerStateChange));
+  sim_.reset();  // it ended with the old bus
+  sim_.emplace(bus_, R"({"server": {"commands": {"Crash": {"fault": "exit"}}}})");
+  ASSERT_TRUE(waitFor(6, kEventServerStateChange));
   client::PerformCommand(manager_, "Crash", record("crash"), {});
-  ASSERT_TRUE(waitFor(1, "crash") && waitFor(5, kEventServerStateChange) && drain());
+  ASSERT_TRUE(waitFor(1, "crash") && waitFor(7, kEventServerStateChange) && drain());
   EXPECT_EQ(mail("hang")[0].result.code, kResultServerGone);
+  EXPECT_EQ(mail("slow")[0].result.code, kResultConnectionLost);
   EXPECT_EQ(mail("crash")[0].result.code, kResultServerGone);
   EXPECT_EQ(sim_->waitExit().describe(), "exit 3");
   EXPECT_EQ(states(), (std::vector<std::string>{kServerStateStarted, "Stopped", kServerStateStarted,
-                                                kServerStateStarted, "Stopped"}));
+                                                kServerStateStarted, "Stopped", kServerStateStarted,
+                                                "Stopped"}));
   for (const Delivery& delivery : mail())
     EXPECT_TRUE(delivery.onQueue) << delivery.name;
 }

@@ -29,38 +29,27 @@ TEST(LogSetPaths, MatchTheToolsOwnLocations) {
   EXPECT_EQ(paths::kVimoCoreDumpSuffix, trace::kVimoCoreDumpSnapshotDirectorySuffix);
 }
 
-struct DumpCase {
-  const char* action;
-  bool compression;
-  std::int64_t vendor;
-  std::string printed;
-  std::string written;
-  bool package;
-};
-
 TEST(LogSetPaths, FollowTheFormTheToolPrints) {
-  const DumpCase cases[] = {
-      {kCollectTelephonyLogs, true, 2, kBase + ".tar.gz", kBase + ".tar.gz", true},
-      {kCollectTelephonyLogs, false, 2, kBase + "-*", kBase + "-tel", false},
-      {kCollectTelephonyLogsWithCoredump, false, 1, kBase + "-*", kBase + "-coredump", false},
-      {kCollectTelephonyLogsWithCoredump, true, 2, kBase + "-*", kBase + "-cd.tar.gz", true},
-      {kCollectBasebandLogs, true, 1, kBase + ".tar.gz", kBase + ".tar.gz", true},
-      {kCollectBasebandLogs, false, 1, kBase + "-bb-trace", kBase + "-bb-trace", false},
-      {kCollectBasebandLogs, false, 0, kBase + "-diag", kBase + "-diag", false},
+  // What the tool prints and what is written, after kBase.
+  const std::tuple<const char*, bool, std::int64_t, std::string, std::string, bool> cases[] = {
+      {kCollectTelephonyLogs, true, 2, ".tar.gz", ".tar.gz", true},
+      {kCollectTelephonyLogs, false, 2, "-*", "-tel", false},
+      {kCollectTelephonyLogsWithCoredump, false, 1, "-*", "-coredump", false},
+      {kCollectTelephonyLogsWithCoredump, true, 2, "-*", "-cd.tar.gz", true},
+      {kCollectBasebandLogs, true, 1, ".tar.gz", ".tar.gz", true},
+      {kCollectBasebandLogs, false, 1, "-bb-trace", "-bb-trace", false},
+      {kCollectBasebandLogs, false, 0, "-diag", "-diag", false},
   };
-  for (const DumpCase& c : cases) {
-    SCOPED_TRACE(std::string(c.action) + (c.compression ? " compressed" : " plain") + " vendor " +
-                 std::to_string(c.vendor));
+  for (const auto& [action, compression, vendor, printed, written, package] : cases) {
     MessageDict request;
-    request.set(kKeyTraceAction, MessageValue::string(c.action));
-    request.set(kKeyTraceDumpStatePerformCompression, MessageValue::boolean(c.compression));
-    const auto set = logSetForDump(request, "T1", c.vendor);
-    ASSERT_TRUE(set.has_value());
-    EXPECT_EQ(set->printed, c.printed);
-    EXPECT_EQ(set->written, c.written);
-    EXPECT_EQ(set->package, c.package);
+    request.set(kKeyTraceAction, MessageValue::string(action));
+    request.set(kKeyTraceDumpStatePerformCompression, MessageValue::boolean(compression));
+    const auto set = logSetForDump(request, "T1", vendor);
+    ASSERT_TRUE(set.has_value()) << action;
+    EXPECT_EQ(std::tie(set->printed, set->written, set->package),
+              std::make_tuple(kBase + printed, kBase + written, package))
+        << action << " " << compression << " " << vendor;
   }
-
   MessageDict other;
   other.set(kKeyTraceAction, MessageValue::string("SomethingElse"));
   EXPECT_FALSE(logSetForDump(other, "T1", 1).has_value());

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: MIT
-// Scenario parsing: a precise place for every mistake. What an accepted scenario does shows on
-// the bus (SimBusTest).
+// Scenario parsing: a precise place for every kind of mistake (SimCommandLine shows how a place is
+// printed; the scenario fuzzer, that whatever is accepted can go on the bus). What an accepted
+// scenario does shows on the bus (SimBusTest).
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -41,13 +42,10 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
   } cases[] = {
       {"{", "", "not valid JSON at line 1, column 2 (syntax error"},
       {"{\"a\": \"\n\"}", "", "U+000A (LF) must be escaped to \\u000A or \\n)"},
-      {"{}\n{}", "", "not valid JSON at line 2"},
       {"[]", "", "expected an object, got an array"},
       {kDeepArray, "", "nested deeper than 64 levels at " + kDeepArrayPointer},
       {R"({"device": {"radio_type": 1e400}})", "",
        "1e400 at /device/radio_type is out of range (line 1, column 31)"},
-      // Reported as not JSON: only a document that is JSON has places.
-      {R"({"device": {"radio_type": 18446744073709551616}, })", "", "not valid JSON"},
       {R"({"device": {"radio_type": 18446744073709551616}})", "/device/radio_type",
        "beyond 64 bits"},
       {R"({"server": {"state": {"payload": {"k": "a\u0000"}}}})", "/server/state/payload/k",
@@ -57,30 +55,16 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
        "payload/a\\u0000\\u000a: this key holds NUL"},
       {R"({"helper": {"timestamp": "\uFDD0"}})", "/helper/timestamp", "noncharacter"},
       {R"({"bogus": 1})", "/bogus", "unknown key"},
-      {R"({"device": {"radio_type": "1"}})", "/device/radio_type",
-       "expected an integer, got a string"},
-      {R"({"device": {"present": 1}})", "/device/present", "expected a boolean"},
-      {R"({"processes": "Telvane"})", "/processes", "expected an array"},
       {R"({"processes": ["ok", "a/b"]})", "/processes/1", "not a process name"},
       {R"({"processes": ["x", "x"]})", "/processes/1", "listed twice"},
-      {R"({"server": {"appear_after_ms": -1}})", "/server/appear_after_ms", "out of range"},
-      {R"({"server": {"commands": {"TraceDumpState": {"result": 1.5}}}})",
-       "/server/commands/TraceDumpState/result", "got a fractional number"},
       {R"({"server": {"commands": {"TraceDumpState": {"result": 4294967296}}}})",
        "/server/commands/TraceDumpState/result", "out of range"},
       {R"({"server": {"commands": {"X": {"reply": "text"}}}})", "/server/commands/X/reply",
        "\"text\" is not one of \"dict\""},
-      {R"({"server": {"commands": {"X": {"fault": true}}}})", "/server/commands/X/fault",
-       "expected one of \"none\""},
-      {R"({"server": {"commands": {"X": {"value": "1"}}}})", "/server/commands/X/value",
-       "unknown key"},
       {R"({"server": {"commands": {"a/b~c": {"bogus": 1}}}})", "/server/commands/a~1b~0c/bogus",
        "unknown key"},
       {R"({"server": {"commands": {"GetTraceProperty": {}}}})", "/server/commands/GetTraceProperty",
        "/server/properties"},
-      {R"({"server": {"state": "Started"}})", "/server/state", "expected an object"},
-      {R"({"server": {"state": {"when": "later"}}})", "/server/state/when",
-       "\"later\" is not one of"},
       {R"({"server": {"state": {"payload": {"list": [1]}}}})", "/server/state/payload/list",
        "an array has no form on the bus"},
       {R"({"server": {"state": {"payload": 0.5}}})", "/server/state/payload",
@@ -88,9 +72,6 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
       {kDeepPayload, kDeepPointer, "nested deeper than 16"},
       {kWidePayload, "/server/state/payload", "more than 1024 entries"},
       {kHeavyPayload, "/server/state/payload/k16/k366", "more than 16384 values"},
-      {R"({"server": {"properties": {"BasebandTrace": {"Enabled": {"value": 1}}}}})",
-       "/server/properties/BasebandTrace/Enabled/value", "expected a string"},
-      {R"({"helper": {"timestamp": 5}})", "/helper/timestamp", "expected a string"},
       {R"({"helper": {"present": null}})", "/helper/present", "got null"},
   };
   for (const auto& c : cases) {

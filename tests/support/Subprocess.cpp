@@ -34,8 +34,8 @@ std::vector<char*> pointers(const std::vector<std::string>& strings) {
 }
 
 // Between fork and exec only async-signal-safe calls: the test process may have threads.
-[[noreturn]] void execChild(pid_t parent, const std::vector<FdMapping>& fds, int* moved,
-                            char* const* argv, char* const* envp) {
+[[noreturn]] void execChild(pid_t parent, const std::vector<FdMapping>& fds, char* const* argv,
+                            char* const* envp) {
   ::prctl(PR_SET_PDEATHSIG, SIGKILL);
   if (::getppid() != parent)
     ::_exit(127);
@@ -45,16 +45,8 @@ std::vector<char*> pointers(const std::vector<std::string>& strings) {
   ::sigprocmask(SIG_SETMASK, &none, nullptr);
   ::signal(SIGPIPE, SIG_DFL);
 
-  // Move every source above every target first, so a mapping cannot clobber another's source.
-  int base = 3;
-  for (const FdMapping& m : fds)
-    base = std::max(base, m.childFd + 1);
-  for (std::size_t i = 0; i < fds.size(); ++i) {
-    if ((moved[i] = ::fcntl(fds[i].parentFd, F_DUPFD, base)) < 0)
-      ::_exit(127);
-  }
-  for (std::size_t i = 0; i < fds.size(); ++i) {
-    if (::dup2(moved[i], fds[i].childFd) < 0)
+  for (const FdMapping& m : fds) {
+    if (::dup2(m.parentFd, m.childFd) < 0)
       ::_exit(127);
   }
   ::syscall(SYS_close_range, 3U, ~0U, CLOSE_RANGE_CLOEXEC);
@@ -101,36 +93,33 @@ pid_t spawnChild(const std::vector<std::string>& args, const EnvChanges& env,
       environment.push_back(name + "=" + *value);
   }
   const std::vector<char*> argv = pointers(args), envp = pointers(environment);
-  std::vector<int> moved(fds.size());
   const pid_t parent = ::getpid();
   const pid_t pid = ::fork();
   if (pid < 0)
     throw systemError("fork");
   if (pid == 0)
-    execChild(parent, fds, moved.data(), argv.data(), envp.data());
+    execChild(parent, fds, argv.data(), envp.data());
   return pid;
 }
 
 ExitStatus waitChild(pid_t pid, std::chrono::milliseconds timeout) {
   ExitStatus status;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
   int raw = 0;
-  for (;;) {
-    const pid_t done = ::waitpid(pid, &raw, WNOHANG);
-    if (done == pid)
-      break;
-    if (done < 0 && errno != EINTR)
-      throw systemError("waitpid");
+  pid_t done;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  // A pidfd would let us sleep exactly until the exit; the kernel may refuse one in a container,
+  // and a few milliseconds of latency do not matter to a test.
+  while ((done = ::waitpid(pid, &raw, WNOHANG)) == 0 || (done < 0 && errno == EINTR)) {
     if (std::chrono::steady_clock::now() >= deadline) {
       ::kill(pid, SIGKILL);
-      ::waitpid(pid, &raw, 0);
+      done = ::waitpid(pid, &raw, 0);
       status.timedOut = true;
       break;
     }
-    // A pidfd would let us sleep exactly until the exit; the kernel may refuse one in a
-    // container, and a few milliseconds of latency do not matter to a test.
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
+  if (done != pid)
+    throw systemError("waitpid");
   status.exited = WIFEXITED(raw);
   status.code = status.exited ? WEXITSTATUS(raw) : -1;
   status.signal = WIFSIGNALED(raw) ? WTERMSIG(raw) : 0;

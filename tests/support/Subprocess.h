@@ -27,7 +27,8 @@ struct ExitStatus {
 // Changes to the test's own environment: a value sets, nullopt removes.
 using EnvChanges = std::vector<std::pair<std::string, std::optional<std::string>>>;
 
-// The child's descriptor childFd becomes a copy of the parent's parentFd.
+// The child's descriptor childFd becomes a copy of the parent's parentFd, in the order given: a
+// parentFd must not be the childFd of an earlier mapping.
 struct FdMapping {
   int parentFd;
   int childFd;

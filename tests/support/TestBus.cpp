@@ -45,6 +45,12 @@ std::string startReporting(const std::vector<std::string>& args, const EnvChange
   return line;
 }
 
+std::string program(const char* path, const char* name) {
+  if (*path == '\0')
+    throw std::runtime_error(std::string("this test binary was built without ") + name);
+  return path;
+}
+
 void terminate(pid_t& pid) {
   if (pid >= 0) {
     ::kill(pid, SIGTERM);
@@ -55,19 +61,11 @@ void terminate(pid_t& pid) {
 }  // namespace
 
 std::string simPath() {
-#ifdef HALVEX_SIM_PATH
-  return HALVEX_SIM_PATH;
-#else
-  throw std::runtime_error("this test binary was built without halvex-sim");
-#endif
+  return program(HALVEX_SIM_PATH, "halvex-sim");
 }
 
 std::string toolPath() {
-#ifdef HALVEXTOOL_PATH
-  return HALVEXTOOL_PATH;
-#else
-  throw std::runtime_error("this test binary was built without halvextool");
-#endif
+  return program(HALVEXTOOL_PATH, "halvextool");
 }
 
 TempDir::TempDir() {

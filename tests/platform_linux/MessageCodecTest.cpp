@@ -116,18 +116,18 @@ TEST_F(CodecTest, StringsTheBusCannotCarryTravelAsNull) {
       "\xf0\x9f\xbf\xbf" /* U+1FFFF */,
       std::string("a\0b", 3),
   };
+  MessageDict sent, expected;
   for (const std::string& text : cases) {
-    MessageDict request;
-    request.set("before", MessageValue::int64(1));
-    request.set("reason", MessageValue::string(text));
-    Message message = newMessage();
-    ASSERT_EQ(appendDict(message.get(), request), 0) << text;
-    seal(message);
-    MessageDict back;
-    ASSERT_EQ(readDict(message.get(), back), 0) << text;
-    request.set("reason", MessageValue::null());
-    EXPECT_EQ(back, request) << text;
+    const std::string key = "k" + std::to_string(sent.size());
+    sent.set(key, MessageValue::string(text));
+    expected.set(key, MessageValue::null());
   }
+  Message message = newMessage();
+  ASSERT_EQ(appendDict(message.get(), sent), 0);
+  seal(message);
+  MessageDict back;
+  ASSERT_EQ(readDict(message.get(), back), 0);
+  EXPECT_EQ(back, expected);
 }
 
 TEST_F(CodecTest, UnsendableShapesAreRejectedBeforeAnythingIsAppended) {

@@ -1,12 +1,6 @@
 // SPDX-License-Identifier: MIT
-// Fixtures for everything that talks over D-Bus: a private bus and the simulated device.
-//
-//   halvex::test::PrivateBus bus;                       // first thing in the test
-//   halvex::test::SimProcess sim(bus, R"({"server": {"present": false}})");
-//   ... run code that opens the system bus ...
-//   auto log = sim.requestLog();
-//
-// A fixture that cannot be set up throws std::runtime_error, which fails the test.
+// Fixtures for everything that talks over D-Bus: a private bus (first thing in a test) and the
+// simulated device on it. A fixture that cannot be set up throws, which fails the test.
 #pragma once
 
 #include <signal.h>

@@ -1,8 +1,6 @@
 // SPDX-License-Identifier: MIT
 // The host backend beside the server's client: device queries, the helper client, the host's own
-// facts (processes, boot arguments) and the system log. The system log speaks the journal's native
-// protocol; the test plays the journal: it binds the socket the journal would and reads the
-// datagrams.
+// facts (processes, boot arguments) and the system log, whose journal the test plays.
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sched.h>

@@ -22,6 +22,7 @@ namespace halvex::test {
 namespace {
 
 using client::Manager;
+using namespace std::literals;
 constexpr std::chrono::seconds kFailsafe{15};
 
 // One delivery: a completion (name is the tag the test gave it) or an event (name is the event).
@@ -145,16 +146,11 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
             R"({"key":"a","type":"string","value":"inner"}]}])");
   EXPECT_EQ(client::PerformCommand(manager_, "Refused", {}, reply).code, 7);
   EXPECT_EQ(reply, MessageValue::string("kept"));
+  for (const std::string command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')})
+    EXPECT_EQ(client::PerformCommand(manager_, command, {}, reply).code, kResultInvalidRequest);
   MessageDict badKey;
   badKey.set("\xff", MessageValue::null());
-  const std::pair<std::string, MessageDict> unsendable[] = {{"Bad\xff", {}},
-                                                            {std::string("Nul\0", 4), {}},
-                                                            {"", {}},
-                                                            {std::string(300, 'c'), {}},
-                                                            {"Fine", badKey}};
-  for (const auto& [command, request] : unsendable)
-    EXPECT_EQ(client::PerformCommand(manager_, command, request, reply).code,
-              kResultInvalidRequest);
+  EXPECT_EQ(client::PerformCommand(manager_, "Fine", badKey, reply).code, kResultInvalidRequest);
   EXPECT_EQ(sim_->requestLog().size(), 2u);
   EXPECT_EQ(client::PerformCommand(manager_, "Hang", {}, reply).code, kResultTimeout);
 

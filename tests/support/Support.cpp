@@ -14,7 +14,6 @@
 #include <cerrno>
 #include <cstring>
 #include <fstream>
-#include <sstream>
 #include <stdexcept>
 #include <thread>
 
@@ -242,10 +241,9 @@ void PrivateBus::stop() {
 }
 
 RunResult PrivateBus::busctl(const std::vector<std::string>& args) const {
-  RunOptions run;
-  run.args = {"/usr/bin/busctl", "--address=" + address_};
-  run.args.insert(run.args.end(), args.begin(), args.end());
-  return runProcess(run);
+  std::vector<std::string> command = {"/usr/bin/busctl", "--address=" + address_};
+  command.insert(command.end(), args.begin(), args.end());
+  return runProcess({command, {}, {}});
 }
 
 SimProcess::SimProcess(const PrivateBus& bus, const std::string& scenarioJson, SimOptions options)
@@ -265,11 +263,11 @@ SimProcess::SimProcess(const PrivateBus& bus, const std::string& scenarioJson, S
   if (line != "ready\n") {
     ::kill(pid_, SIGKILL);
     const ExitStatus status = waitChild(std::exchange(pid_, -1), std::chrono::seconds(5));
-    std::ostringstream stderrText;
-    stderrText << std::ifstream(errPath).rdbuf();
-    throw std::runtime_error("halvex-sim did not get ready (" +
-                             (line.empty() ? status.describe() : "said \"" + line + "\"") +
-                             "); its stderr: " + stderrText.str());
+    std::ifstream err(errPath);
+    throw std::runtime_error(
+        "halvex-sim did not get ready (" +
+        (line.empty() ? status.describe() : "said \"" + line + "\"") +
+        "); its stderr: " + std::string(std::istreambuf_iterator<char>(err), {}));
   }
 }
 

@@ -1,0 +1,244 @@
+// SPDX-License-Identifier: MIT
+// The host backend beside the server's client: device queries, the helper client, the host's own
+// facts (processes, boot arguments) and the system log, whose journal the test plays.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <regex>
+#include <string>
+#include <thread>
+
+#include "platform/DevicePropertyService.h"
+#include "platform/DeviceQueries.h"
+#include "platform/HelperClient.h"
+#include "platform/ServerClient.h"
+#include "platform/ServerProtocol.h"
+#include "platform/SystemLog.h"
+#include "platform/linux/testing/BusTesting.h"
+#include "tests/support/TestBus.h"
+
+namespace halvex::test {
+namespace {
+
+namespace fs = std::filesystem;
+using Fields = std::map<std::string, std::string>;
+
+std::string askDevice() {
+  return std::to_string(device::getRadioType()) + " " + std::to_string(device::getRadioVendor()) +
+         " " + std::to_string(device::getProductType()) + " " +
+         std::to_string(device::isInternalBuild()) + std::to_string(device::isCarrierBuild()) +
+         std::to_string(device::isVendorBuild()) + std::to_string(device::isTraceAllowed());
+}
+
+// The identity is asked once per process, but only an answer is kept: a host whose device
+// service was missing, or whose bus restarted, must not read as "no baseband" for good.
+TEST(DeviceIdentityTest, AskedOnceAndKeptOnlyWhenAnswered) {
+  PrivateBus bus;
+  {
+    SimProcess sim(bus, R"({"device": {"present": false}})");
+    EXPECT_EQ(askDevice(), "0 0 0 0000");
+  }
+  bus.restart();
+  SimProcess sim(bus, R"({"device": {"radio_type": 7, "radio_vendor": 1, "product_type": 58,
+      "internal_build": false, "carrier_build": true, "vendor_build": true,
+      "trace_allowed": false}})");
+  EXPECT_EQ(askDevice(), "7 1 58 0110");
+  EXPECT_EQ(askDevice(), "7 1 58 0110");
+  ASSERT_EQ(sim.requestLog().size(), 1u);
+  EXPECT_EQ(sim.requestLog()[0].dump(), R"({"method":"GetIdentity","service":"device"})");
+  bus.stop();
+  EXPECT_EQ(askDevice(), "7 1 58 0110");
+}
+
+// Only plain names name a service. The reply comes in as an empty dictionary and is left alone
+// when the request fails.
+TEST(HelperClientTest, PerformRunsTheCommandInTheService) {
+  const std::string tooLong(300, 'h');
+  for (const char* name : {static_cast<const char*>(nullptr), "", "two words", "tab\there",
+                           "del\x7f", "\xc3\xa9t\xc3\xa9", tooLong.c_str()}) {
+    EXPECT_EQ(HelperClient::create(name, nullptr), nullptr) << (name ? name : "(null)");
+  }
+  PrivateBus bus;
+  MessageDict request;
+  request.set(helper::kKeyTimeout, MessageValue::int64(1500));
+  const struct {
+    const char* scenario;
+    const char* command;
+    std::int32_t code;
+    const char* reply;
+  } cases[] = {
+      {R"({"helper": {"timestamp": "H"}})", helper::kCommandVarniskStatus, 0,
+       R"({"TimestampString": "H"})"},
+      {R"({"helper": {"result": 9}})", helper::kCommandVarniskStatus, 9, "{}"},
+      {"{}", "Bad\xff", kResultInvalidRequest, "{}"},
+  };
+  for (const auto& c : cases) {
+    SimProcess sim(bus, c.scenario);
+    auto helper = HelperClient::create("logdump.helper", nullptr);
+    ASSERT_TRUE(helper);
+    MessageValue reply = MessageValue::dict({});
+    Result result = helper->perform(helper::kTaskDiagnosticsCollection, c.command, request, reply);
+    EXPECT_EQ(result.code, c.code) << c.scenario << ": " << result.message;
+    EXPECT_EQ(describe(reply), c.reply) << c.scenario;
+    if (&c == &cases[0]) {
+      EXPECT_EQ(sim.requestLog().at(0).dump(),
+                R"({"client":"logdump.helper","command":"VarniskStatus","keys":[)"
+                R"({"key":"Timeout","type":"int64","value":1500}],"method":"Perform",)"
+                R"("service":"helper","task":4})");
+    }
+  }
+}
+
+// The simulator keeps the processes a scenario names, for as long as it runs.
+TEST(ProcessCheckTest, FindsProcessesByTheirWholeName) {
+  // Unique per test process, so that parallel tests cannot see each other's processes. The long
+  // name is cut to 15 bytes in the kernel's view; the short one is not.
+  const std::string pid = std::to_string(getpid());
+  const std::string longName = "halvex-long-process-name-" + pid;
+  const std::string shortName = "hx" + pid.substr(0, 8);
+  EXPECT_FALSE(device::isProcessRunning(longName));
+  PrivateBus bus;
+  SimProcess sim(bus, R"({"processes": [")" + longName + R"(", ")" + shortName + R"("]})");
+  EXPECT_TRUE(device::isProcessRunning(longName));
+  EXPECT_TRUE(device::isProcessRunning(shortName));
+  for (const std::string& wrong : {longName.substr(0, 15), longName + "x",
+                                   shortName.substr(0, shortName.size() - 1), std::string()})
+    EXPECT_FALSE(device::isProcessRunning(wrong)) << wrong;
+  // Even a simulator killed outright takes them along.
+  sim.kill(SIGKILL);
+  EXPECT_EQ(sim.waitExit().signal, SIGKILL);
+  const auto running = [&] {
+    return device::isProcessRunning(longName) || device::isProcessRunning(shortName);
+  };
+  for (const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(15);
+       running() && std::chrono::steady_clock::now() < deadline;)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  EXPECT_FALSE(running());
+  EXPECT_EQ(device::getProgramName(), "platform_linux_bus_test");
+}
+
+TEST(DevicePropertyTest, BootArgumentsAreTheKernelCommandLine) {
+  std::string line;
+  std::getline(std::ifstream("/proc/cmdline"), line);
+  EXPECT_EQ(DevicePropertyService::create()->getPropertyMap()["boot-args"], line);
+}
+
+// Binds the socket the journal would, in a mount namespace of its own over a fresh /run, so that
+// a journal running on the machine is neither disturbed nor in the way. Only root can, and before
+// any thread starts: children and threads started later share the namespace.
+class FakeJournal {
+ public:
+  FakeJournal() {
+    sockaddr_un address{AF_UNIX, "/run/systemd/journal/socket"};
+    std::error_code error;
+    if (::geteuid() != 0) {
+      problem_ = "only root can stand in for the journal";
+    } else if (::unshare(CLONE_NEWNS) != 0 ||
+               ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+               ::mount("tmpfs", "/run", "tmpfs", 0, "mode=0755") != 0 ||
+               !fs::create_directories("/run/systemd/journal", error) ||
+               ::bind(fd_, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+      problem_ = std::string("cannot stand in for the journal: ") + std::strerror(errno);
+    }
+  }
+  ~FakeJournal() { ::close(fd_); }
+
+  // Empty when the journal could be stood in for.
+  const std::string& problem() const { return problem_; }
+
+  // The next entry from subsystem and category, skipping everything else that is logged
+  // meanwhile; an empty map when none came within five seconds. Fields are "KEY=value\n": the
+  // tests log nothing that the protocol would have to send in its binary form.
+  Fields receive(const std::string& subsystem, const std::string& category) {
+    std::string data(1 << 20, '\0');
+    pollfd ready{fd_, POLLIN, 0};
+    while (::poll(&ready, 1, 5000) == 1) {
+      const ssize_t got = ::recv(fd_, data.data(), data.size(), 0);
+      Fields fields;
+      for (std::size_t at = 0, end; got > 0 && at < static_cast<std::size_t>(got); at = end + 1) {
+        end = data.find('\n', at);
+        const std::size_t equals = data.find('=', at);
+        fields[data.substr(at, equals - at)] = data.substr(equals + 1, end - equals - 1);
+      }
+      if (fields["SUBSYSTEM"] == subsystem && fields["CATEGORY"] == category)
+        return fields;
+    }
+    return {};
+  }
+
+ private:
+  int fd_ = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  std::string problem_;
+};
+
+// Entries carry message, priority, subsystem and category, and every request the platform makes
+// leaves one: what it was, its code and how long it took; failures at warning priority, successes
+// at debug.
+TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
+  FakeJournal journal;
+  if (!journal.problem().empty())
+    GTEST_SKIP() << journal.problem();
+  auto server = LogServer::create();
+  const LogContext context("org.halvex.test", "journal-test");
+  const std::pair<LogLevel, std::string> rows[] = {
+      {LogLevel::kError, "dump failed: 100%"},
+      {LogLevel::kWarning, std::string("with\0nul", 8)},
+      {LogLevel::kNotice, "notice"},
+      {LogLevel::kInfo, "info"},
+      {LogLevel::kDebug, ""},
+  };
+  int nextPriority = 3;
+  for (const auto& [level, message] : rows) {
+    server->write(context, level, message);
+    Fields fields = journal.receive("org.halvex.test", "journal-test");
+    EXPECT_EQ(fields["MESSAGE"], message);
+    EXPECT_EQ(fields["PRIORITY"], std::to_string(nextPriority++));
+    // The journal library names the program itself.
+    EXPECT_EQ(fields["SYSLOG_IDENTIFIER"], program_invocation_short_name);
+  }
+  // A runaway message is cut, not sent whole.
+  server->write(context, LogLevel::kError, std::string(100 * 1024, 'x'));
+  EXPECT_EQ(journal.receive("org.halvex.test", "journal-test")["MESSAGE"],
+            std::string(16 * 1024, 'x'));
+
+  PrivateBus bus;
+  SimProcess sim(bus, R"({"server": {"commands": {"Refused": {"result": 7}}}})");
+  bus::RunLoopThreadForTesting loop;
+  EXPECT_EQ(device::getRadioType(), 1);
+  auto manager = client::CreateManager("halvextool", WorkQueue::create("test.queue"));
+  MessageValue reply;
+  EXPECT_TRUE(client::PerformCommand(manager, kCommandTraceDumpState, {}, reply).ok());
+  EXPECT_EQ(client::PerformCommand(manager, "Refused", {}, reply).code, 7);
+  EXPECT_TRUE(
+      HelperClient::create("logdump.helper", nullptr)
+          ->perform(helper::kTaskDiagnosticsCollection, helper::kCommandVarniskStatus, {}, reply)
+          .ok());
+  const std::tuple<const char*, std::string, const char*> expected[] = {
+      {"device", "GetIdentity: code 0x00000000", "7"},
+      {"server", "PerformCommand TraceDumpState: code 0x00000000", "7"},
+      {"server", "PerformCommand Refused: code 0x00000007", "4"},
+      {"helper", "Perform logdump.helper VarniskStatus: code 0x00000000", "7"},
+  };
+  for (const auto& [category, pattern, priority] : expected) {
+    auto fields = journal.receive("org.halvex.platform", category);
+    EXPECT_TRUE(
+        std::regex_match(fields["MESSAGE"], std::regex(pattern + R"( in \d+\.\d{3} ms(: .*)?)")))
+        << fields["MESSAGE"];
+    EXPECT_EQ(fields["PRIORITY"], priority) << pattern;
+  }
+}
+
+}  // namespace
+}  // namespace halvex::test

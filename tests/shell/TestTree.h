@@ -20,15 +20,13 @@ namespace halvex::testing {
 class TestCommand : public CommandBase {
  public:
   using Setup = std::function<void(TestCommand&)>;
-
-  TestCommand(std::string name, std::weak_ptr<CommandBase> parent, Setup setup)
-      : CommandBase(std::move(name), std::move(parent)), setup_(std::move(setup)) {}
+  using CommandBase::CommandBase;
 
   static std::shared_ptr<TestCommand> create(std::string name,
                                              std::weak_ptr<CommandBase> parent = {},
                                              Setup setup = {}) {
-    auto command =
-        std::make_shared<TestCommand>(std::move(name), std::move(parent), std::move(setup));
+    auto command = std::make_shared<TestCommand>(std::move(name), std::move(parent));
+    command->setup_ = std::move(setup);
     command->init();
     return command;
   }
@@ -87,10 +85,7 @@ inline std::shared_ptr<TestCommand> makeToolTree() {
 
 inline const std::string kBuiltinsHelp =
     "\t              cd  -  <sub-command>\n"
-    "\t            help\n"
-    "\t            back\n"
-    "\t            quit\n"
-    "\n";
+    "\t            help\n\t            back\n\t            quit\n\n";
 
 inline const std::string kRootHelp =
     "\nOptions for command '\x1b[32mhalvextool\x1b[39m':\n\n"

@@ -1,12 +1,60 @@
 // SPDX-License-Identifier: MIT
+// The real halvextool against halvex-sim on a private bus, each run compared whole: exit status,
+// both output streams and the requests the simulated device received.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <string>
+#include <vector>
 
-#include "tests/tool_e2e/ToolRun.h"
+#include "tests/support/TestBus.h"
 
 namespace halvex::e2e {
 namespace {
+
+const std::string kPrompt = "(/halvextool)>> ";
+const std::string kPath = "Path = /var/wireless/Library/Logs/Faultkeep/Baseband/log-bb-";
+const std::string kTel = "Telephony log collection: ";
+const std::string kModeQuery =
+    "halvextool GetTraceProperty TraceName='SystemLogs' TracePropertyName='Mode'";
+const std::string kTelDump =
+    "halvextool TraceDumpState TraceAction='CollectTelephonyLogs' "
+    "TraceDumpStateReason='[halvextool] User triggered' TraceDumpStatePerformCompression=true";
+
+std::vector<std::string> commandRequests(const test::SimProcess& sim) {
+  std::vector<std::string> lines;
+  for (const nlohmann::json& entry : sim.requestLog()) {
+    if (!entry.contains("command")) {
+      continue;  // subscriptions and device identity queries
+    }
+    std::string line = entry.value("client", "") + " " + entry.value("command", "");
+    line += entry.contains("task") ? " task=" + entry["task"].dump() : "";
+    for (const nlohmann::json& key : entry["keys"]) {
+      const nlohmann::json& value = key["value"];
+      line += " " + key.value("key", "") + "=" +
+              (value.is_string() ? "'" + value.get<std::string>() + "'" : value.dump());
+    }
+    lines.push_back(line);
+  }
+  return lines;
+}
+
+// Runs the tool with words, or interactively (no words) reading input to its end, on a device
+// that plays scenario, and compares everything. Requests read "client command key=value ...",
+// strings in single quotes.
+void runSession(const char* what, const std::string& scenario, std::vector<std::string> words,
+                const std::string& input, const std::string& status, const std::string& out,
+                const std::string& err, const std::vector<std::string>& requests) {
+  SCOPED_TRACE(what);
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, scenario);
+  words.insert(words.begin(), HALVEXTOOL_BINARY);
+  const test::RunResult run = test::runProcess({.args = words, .env = {}, .input = input});
+  EXPECT_EQ(run.status.describe(), status);
+  EXPECT_EQ(run.out, out);
+  EXPECT_EQ(run.err, err);
+  EXPECT_EQ(commandRequests(sim), requests);
+}
 
 // Product 58 needs neither daemon, so these runs do not depend on the process table.
 std::string exempt(const std::string& server) {
@@ -89,6 +137,28 @@ TEST(ToolSession, InteractiveRuns) {
              exempt(R"({"commands": {"TraceDumpState": {"fault": "exit"}}})"), {},
              "logdump tel\nquit\n", "exit 0", kPrompt + kTel + "Failed\n" + kPrompt, "",
              {kModeQuery, kTelDump});
+}
+
+// The simulator keeps processes with the names it is given alive while it runs.
+TEST(DaemonCheck, EitherDaemonByItsExactNameLetsTheToolStart) {
+  if (::getpid() != 1) {
+    GTEST_SKIP() << "needs a pid namespace of its own, so that no other process on the machine "
+                    "can be named like a daemon; run the suite as root";
+  }
+  const auto product57 = [](const std::string& processes) {
+    return R"({"device": {"product_type": 57}, "processes": )" + processes +
+           R"(, "server": {"commands": {"TraceDumpState": {"timestamp": "T"}}}})";
+  };
+  const std::string started = kTel + "Success\n" + kPath + "T.tar.gz\n";
+  runSession(
+      "neither", product57(R"(["telvane", "Kelmond", "Telvane2"])"), {"logdump", "tel"}, "",
+      "exit 255",
+      "Telvane process is not running. Please run/load Telvane (or kelmond) and try again.\n", "",
+      {});
+  for (const char* daemon : {"Telvane", "kelmond"}) {
+    runSession(daemon, product57(std::string("[\"") + daemon + "\"]"), {"logdump", "tel"}, "",
+               "exit 0", started, "", {kModeQuery, kTelDump});
+  }
 }
 
 }  // namespace

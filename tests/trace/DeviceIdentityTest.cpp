@@ -45,46 +45,6 @@ TEST(DeviceIdentity, BuildTypeRulesAskLazilyAndAfresh) {
   }
 }
 
-class RadioModelName : public ::testing::TestWithParam<int> {};
-
-TEST_P(RadioModelName, IsAskedOnceAndKeptForGood) {
-  const int radio = GetParam();
-  useDevice({.radioType = radio});
-  const std::string name = getRadioModelName();
-  if (radio >= 1 && radio <= 10) {
-    // Two to five letters or digits, at most one of them a dot.
-    EXPECT_TRUE(std::regex_match(name, std::regex(R"((?=.{2,5}$)[A-Za-z0-9]*\.?[A-Za-z0-9]*)")))
-        << name;
-  } else {
-    EXPECT_EQ(name, "Unknown");
-  }
-  useDevice({.radioType = radio == 5 ? 6 : 5});
-  EXPECT_EQ(getRadioModelName(), name);
-  EXPECT_EQ(takeCalls(), Calls{});
-}
-
-INSTANTIATE_TEST_SUITE_P(Types, RadioModelName,
-                         ::testing::Values(INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11));
-
-// The property map is read once, so a later change or absence of "boot-args" is never seen.
-class BootArgs : public ::testing::TestWithParam<bool> {};
-
-TEST_P(BootArgs, ComeFromOnePropertyMapRead) {
-  const std::string expected = GetParam() ? "debug=0x14" : "";
-  fake::Device device{.properties = {{"serial", "X1"}}};
-  if (GetParam()) {
-    device.properties["boot-args"] = expected;
-  }
-  useDevice(device);
-  EXPECT_EQ(getBootArgs(), expected);
-  EXPECT_EQ(takeCalls(), (Calls{"DevicePropertyService::create", "getPropertyMap"}));
-  useDevice({.properties = {{"boot-args", "changed"}}});
-  EXPECT_EQ(getBootArgs(), expected);
-  EXPECT_EQ(takeCalls(), Calls{});
-}
-
-INSTANTIATE_TEST_SUITE_P(WithAndWithout, BootArgs, ::testing::Bool());
-
 TEST(DeviceIdentity, GlobalLoggerKeepsTheFirstServer) {
   const auto first = LogServer::create();
   const auto second = LogServer::create();
@@ -101,6 +61,35 @@ TEST(DeviceIdentity, GlobalLoggerKeepsTheFirstServer) {
   EXPECT_TRUE(std::regex_match(lines[0].subsystem, std::regex(R"([a-z]+(\.[a-z]+)+)")));
   EXPECT_EQ(lines[0].category, "global");
   EXPECT_EQ(lines[0].message, "hello");
+}
+
+template <typename Enum>
+std::string textOf(int value) {
+  return diag::config::toString(static_cast<Enum>(value));
+}
+
+TEST(DiagConfig, DisplayTextsEndAtTheLastEnumerator) {
+  using namespace diag::config;
+  const std::pair<std::string, const char*> rows[] = {
+      {textOf<Mode>(0), "Active on AP"},
+      {textOf<Mode>(3), "Passive external through software"},
+      {textOf<Mode>(4), "Passive on AP"},
+      {textOf<Mode>(5), "Unknown"},
+      {textOf<Mode>(255), "Unknown"},
+      {textOf<Mode>(-1), "Unknown"},
+      {textOf<DuringAPSleep>(0), "Off"},
+      {textOf<DuringAPSleep>(2), "Lite"},
+      {textOf<DuringAPSleep>(3), "Unknown"},
+      {textOf<DuringAPSleep>(-1), "Unknown"},
+      {textOf<Recovery>(0), kNoneDMCFile},
+      {textOf<Recovery>(2), "Reconfigure"},
+      {textOf<Recovery>(3), "Unknown"},
+      {textOf<Recovery>(INT_MIN), "Unknown"},
+      {textOf<Mode>(kDefaultMode), "Active on AP"},
+  };
+  for (const auto& [text, expected] : rows) {
+    EXPECT_EQ(text, expected);
+  }
 }
 
 }  // namespace

@@ -2,6 +2,8 @@
 #include <gtest/gtest.h>
 
 #include <climits>
+#include <functional>
+#include <set>
 
 #include "TraceTestSupport.h"
 #include "halvex/trace/DeviceIdentity.h"
@@ -10,48 +12,33 @@
 namespace halvex::trace::tests {
 namespace {
 
-// Radio-dependent rules on an internal build with tracing allowed.
+// Each radio-dependent rule against every radio type, on an internal build with tracing allowed:
+// the radios it holds for, and that it asks the radio afresh while the permission stays cached.
 TEST(TraceCatalog, RadioRulesAcrossEveryType) {
-  struct Row {
-    int radio;
-    bool nonPCI, not9Or10, coreDumpStatus, dumpLogIndication, kernelPCI, basebandIPC;
-  };
-  const Row rows[] = {
-      {INT_MIN, false, true, false, false, false, false},
-      {-1, false, true, false, false, false, false},
-      {0, false, true, false, false, false, false},
-      {1, true, true, true, true, false, true},
-      {2, true, true, true, true, false, true},
-      {3, false, true, true, true, true, true},
-      {4, false, true, false, true, true, true},
-      {5, false, true, false, false, true, true},
-      {6, false, true, false, true, true, true},
-      {7, false, true, false, false, true, true},
-      {8, true, true, true, true, false, true},
-      {9, false, false, false, true, true, true},
-      {10, false, false, false, false, true, true},
-      {11, false, true, false, false, false, false},
-      {INT_MAX, false, true, false, false, false, false},
+  const std::set<int> none = {INT_MIN, -1, 0, 11, INT_MAX};
+  const std::tuple<const char*, std::function<bool()>, std::set<int>> rules[] = {
+      {"nonPCI", isNonPCIRadio, {1, 2, 8}},
+      {"PCI", isPCIRadio, {INT_MIN, -1, 0, 3, 4, 5, 6, 7, 9, 10, 11, INT_MAX}},
+      {"not9Or10", isNotType9Or10Radio, {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 11, INT_MAX}},
+      {"coreDumpStatus", isCoreDumpStatusSupported, {1, 2, 3, 8}},
+      {"kernelPCI", isKernelPCITraceSupported, {3, 4, 5, 6, 7, 9, 10}},
+      {"basebandIPC", [] { return isSupported(kBasebandIPC); }, {1, 2, 3, 4, 5, 6, 7, 8, 9, 10}},
+      {"dumpLogIndication", isDumpLogIndicationSupported, {1, 2, 3, 4, 6, 8, 9}},
   };
   ASSERT_TRUE(isAllowed());
-  for (const Row& row : rows) {
-    SCOPED_TRACE(::testing::Message() << "radio " << row.radio);
-    useDevice({.radioType = row.radio, .internalBuild = true});
-    EXPECT_EQ(isNonPCIRadio(), row.nonPCI);
-    EXPECT_EQ(isPCIRadio(), !row.nonPCI);
-    EXPECT_EQ(isNotType9Or10Radio(), row.not9Or10);
-    EXPECT_EQ(isCoreDumpStatusSupported(), row.coreDumpStatus);
-    EXPECT_EQ(isKernelPCITraceSupported(), row.kernelPCI);
-    EXPECT_EQ(isSupported(kBasebandIPC), row.basebandIPC);
-    EXPECT_EQ(isDumpLogIndicationSupported(), row.dumpLogIndication);
-    // Each rule asks the radio afresh; the permission stays cached.
-    const Calls radioOnly(6, "getRadioType");
-    Calls expected = radioOnly;
-    expected.insert(expected.end(), {"isInternalBuild", "getRadioType"});
-    EXPECT_EQ(takeCalls(), expected);
+  for (const auto& [name, rule, holds] : rules) {
+    for (int radio : {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, INT_MAX}) {
+      useDevice({.radioType = radio, .internalBuild = true});
+      EXPECT_EQ(rule(), holds.contains(radio)) << name << " radio " << radio;
+      const Calls asked = std::string(name) == "dumpLogIndication"
+                              ? Calls{"isInternalBuild", "getRadioType"}
+                              : Calls{"getRadioType"};
+      EXPECT_EQ(takeCalls(), asked) << name << " radio " << radio;
+    }
   }
 }
 
+// The permission is asked only for a radio in range, once, and its first answer stands.
 TEST(TraceCatalog, PermissionIsAskedOnlyInRangeAndOnlyOnce) {
   for (int radio : {-1, 0, 11}) {
     useDevice({.radioType = radio, .traceAllowed = false});
@@ -62,68 +49,49 @@ TEST(TraceCatalog, PermissionIsAskedOnlyInRangeAndOnlyOnce) {
   useDevice({.radioType = 8, .traceAllowed = false});
   EXPECT_FALSE(isKernelPCITraceSupported());
   EXPECT_EQ(takeCalls(), Calls{"getRadioType"});
-
   useDevice({.radioType = 9, .traceAllowed = false});
   EXPECT_FALSE(isSupported("BasebandIPC"));
   EXPECT_EQ(takeCalls(), (Calls{"getRadioType", "isTraceAllowed"}));
-
-  // A later grant is not seen: the first answer stands for the whole process.
   useDevice({.radioType = 9, .traceAllowed = true});
   EXPECT_FALSE(isKernelPCITraceSupported());
   EXPECT_FALSE(isSupported("IPC"));
-  EXPECT_FALSE(isAllowed());
   EXPECT_EQ(takeCalls(), Calls{"getRadioType"});
 }
 
-// The catalogue once with tracing allowed and once, in its own process, with it denied.
+// The catalogue once with tracing allowed and once, in its own process, with it denied. The
+// first name that matches decides, and only its rule asks the platform.
 class SupportedNames : public ::testing::TestWithParam<bool> {};
 
 TEST_P(SupportedNames, FollowTheCatalogue) {
   const bool allowed = GetParam();
-  struct Row {
-    std::string name;
+  struct Group {
+    std::vector<std::string> names;
     int vendor;
     bool whenAllowed, whenDenied;
-    Calls calls;
+    const char* asks;
   };
-  const Calls vendor{"getRadioVendor"};
-  const Row rows[] = {
-      {"Halvex", 0, true, true, {}},
-      {"hALVEX", 3, true, true, {}},
-      {std::string("HALVEX\0junk", 11), 0, true, true, {}},
-      {"BASEBANDTRACE", 0, true, true, {}},
-      {"coredump", 0, true, true, {}},
-      {"pRoFiLe", 0, true, true, {}},
-      {"DIAG", 2, true, true, vendor},
-      {"diag", 1, false, false, vendor},
-      {"Diag", 0, false, false, vendor},
-      {"QoroTrace", 1, true, true, vendor},
-      {"qorotrace", 2, false, false, vendor},
-      {"QOROTRACE", 0, false, false, vendor},
-      {"vimocoredump", 2, true, true, vendor},
-      {"VimoCoreDump", 1, false, false, vendor},
-      {"QoroCoreDump", 1, true, true, vendor},
-      {"qorocoredump", 3, false, false, vendor},
-      {"BasebandIPC", 0, true, false, {"getRadioType"}},
-      {"ipc", 0, true, false, {}},
-      {"COMPRESSION", 0, true, false, {}},
-      {"tixo", 0, true, false, {}},
-      {"SystemLogs", 0, true, false, {}},
-      {"ddt", 0, true, false, {}},
-      {"Settings", 0, true, false, {}},
-      {"CSILog", 2, false, false, {}},
-      {"TelephonyLog", 2, false, false, {}},
-      {"", 0, false, false, {}},
-      {"Halvex ", 0, false, false, {}},
-      {"Snaptrail", 0, false, false, {}},
+  const char* const vendor = "getRadioVendor";
+  const Group groups[] = {
+      {{"Halvex", std::string("HALVEX\0junk", 11), "BASEBANDTRACE"}, 0, true, true, ""},
+      {{"coredump", "pRoFiLe"}, 0, true, true, ""},
+      {{"DIAG", "vimocoredump"}, 2, true, true, vendor},
+      {{"QoroTrace", "QoroCoreDump"}, 1, true, true, vendor},
+      {{"diag", "VimoCoreDump"}, 1, false, false, vendor},
+      {{"qorotrace"}, 2, false, false, vendor},
+      {{"qorocoredump"}, 3, false, false, vendor},
+      {{"BasebandIPC"}, 0, true, false, "getRadioType"},
+      {{"ipc", "COMPRESSION", "tixo", "SystemLogs", "ddt", "Settings"}, 0, true, false, ""},
+      {{"CSILog", "TelephonyLog", "", "Halvex ", "Snaptrail"}, 2, false, false, ""},
   };
   useDevice({.radioType = 4, .traceAllowed = allowed});
   EXPECT_EQ(isAllowed(), allowed);
-  for (const Row& row : rows) {
-    useDevice({.radioType = 4, .radioVendor = row.vendor, .traceAllowed = allowed});
-    EXPECT_EQ(isSupported(row.name), allowed ? row.whenAllowed : row.whenDenied)
-        << '"' << row.name << "\" vendor " << row.vendor;
-    EXPECT_EQ(takeCalls(), row.calls) << '"' << row.name << '"';
+  for (const Group& group : groups) {
+    for (const std::string& name : group.names) {
+      SCOPED_TRACE('"' + name + "\" vendor " + std::to_string(group.vendor));
+      useDevice({.radioType = 4, .radioVendor = group.vendor, .traceAllowed = allowed});
+      EXPECT_EQ(isSupported(name), allowed ? group.whenAllowed : group.whenDenied);
+      EXPECT_EQ(takeCalls(), *group.asks != '\0' ? Calls{group.asks} : Calls{});
+    }
   }
 }
 

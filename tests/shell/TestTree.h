@@ -107,30 +107,21 @@ inline std::string prompt(const std::string& path) {
   return "(" + path + ")>> ";
 }
 
-class TestShell : public CommandShell {
- public:
-  explicit TestShell(std::shared_ptr<CommandBase> root) : root_(std::move(root)) {}
-
- protected:
-  std::shared_ptr<CommandBase> createRootCommand() override { return root_; }
-
- private:
-  std::shared_ptr<CommandBase> root_;
-};
-
 struct ShellRun {
   bool ok;
-  std::string out;
-  std::string err;
+  std::string out, err;
 };
 
 inline ShellRun runShell(std::shared_ptr<CommandBase> root, std::vector<std::string> args,
                          const std::string& input = "") {
+  struct Shell : CommandShell {
+    std::shared_ptr<CommandBase> root;
+    std::shared_ptr<CommandBase> createRootCommand() override { return root; }
+  } shell;
+  shell.root = std::move(root);
   std::istringstream in(input);
-  std::ostringstream out;
-  std::ostringstream err;
+  std::ostringstream out, err;
   ScopedConsoleForTesting console(in, out, err);
-  TestShell shell(std::move(root));
   const bool ok = shell.run(std::move(args));
   return {ok, out.str(), err.str()};
 }

@@ -11,33 +11,28 @@ namespace halvex {
 namespace {
 
 TEST(ParseDumpOptions, WordsBeforeTheReasonSetFlagsAndTheRestIsLeft) {
-  struct Row {
-    std::vector<std::string> words;
-    bool compress;
-    bool nonui;
-    std::string reason;
-    std::vector<std::string> left;
+  // Words, then the flags, the reason and the words left after parsing.
+  const std::string p = "[halvextool] ";
+  using Words = std::vector<std::string>;
+  const std::tuple<Words, bool, bool, std::string, Words> rows[] = {
+      {{}, true, false, p + "User triggered", {}},
+      {{"nocompress", "nonui", "crash1"}, false, true, p + "crash1", {}},
+      {{"crash1", "nocompress"}, true, false, p + "crash1", {"nocompress"}},
+      {{"NoCompress"}, true, false, p + "NoCompress", {}},
+      {{"nonui", "nonui"}, true, true, p + "User triggered", {}},
+      {{"nonui", "nocompress", "a", "b", "nonui"}, false, true, p + "a", {"b", "nonui"}},
+      {{""}, true, false, p, {}},
   };
-  const Row rows[] = {
-      {{}, true, false, "[halvextool] User triggered", {}},
-      {{"nocompress", "nonui", "crash1"}, false, true, "[halvextool] crash1", {}},
-      {{"crash1", "nocompress"}, true, false, "[halvextool] crash1", {"nocompress"}},
-      {{"NoCompress"}, true, false, "[halvextool] NoCompress", {}},
-      {{"nonui", "nonui"}, true, true, "[halvextool] User triggered", {}},
-      {{"nonui", "nocompress", "a", "b", "nonui"}, false, true, "[halvextool] a", {"b", "nonui"}},
-      {{""}, true, false, "[halvextool] ", {}},
-  };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(testing::PrintToString(row.words));
-    std::vector<std::string> words = row.words;
-    bool compress = true;
-    bool nonui = false;
+  for (const auto& [given, compressed, nonuiSet, reasonSet, left] : rows) {
+    SCOPED_TRACE(testing::PrintToString(given));
+    std::vector<std::string> words = given;
+    bool compress = true, nonui = false;
     std::string reason = "stale";
     parseDumpOptions(words, compress, reason, nonui);
-    EXPECT_EQ(compress, row.compress);
-    EXPECT_EQ(nonui, row.nonui);
-    EXPECT_EQ(reason, row.reason);
-    EXPECT_EQ(words, row.left);
+    EXPECT_EQ(compress, compressed);
+    EXPECT_EQ(nonui, nonuiSet);
+    EXPECT_EQ(reason, reasonSet);
+    EXPECT_EQ(words, left);
   }
 }
 

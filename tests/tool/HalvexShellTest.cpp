@@ -2,13 +2,10 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <memory>
 #include <set>
-#include <stdexcept>
 #include <string>
 #include <vector>
 
-#include "Tools/HalvexTool/HalvexCommand.h"
 #include "Tools/HalvexTool/HalvexShell.h"
 #include "Tools/HalvexTool/ServerState.h"
 #include "tests/tool/ToolTestSupport.h"
@@ -105,12 +102,6 @@ TEST(ServerState, EveryEventOverwritesTheFlagThatLogdumpChecks) {
     }
   }
   EXPECT_TRUE(FakePlatform::get().serverRequests().empty());
-}
-
-TEST(HalvexCommand, RootWithoutAnOwnerCannotRegisterItsChildren) {
-  WorkQueue queue = WorkQueue::create("test.queue");
-  HalvexCommand unowned("halvextool", {}, client::CreateManager("halvextool", queue), queue);
-  EXPECT_THROW(unowned.init(), std::bad_weak_ptr);
 }
 
 }  // namespace

@@ -73,7 +73,6 @@ TEST(LogCollection, OutcomesOfEveryCollection) {
       {{"bb"}, {.enabled = failed(kResultTimeout)}, bbFailed, {}, {}, true, false},
       {{"bb"}, {.enabled = ok(MessageValue::string("1"))}, bbFailed},
       {{"bb"}, {.enabled = property("TRUE")}, off},
-      {{"bb"}, {.enabled = property("0")}, off},
       {{"bb"}, {.enabled = empty}, off},
       {{"bb"}, {.enabled = property("true")}, running + "T1.tar.gz\n"},
       {{"bb", "nocompress"}, {}, running + "T1-bb-trace\n"},
@@ -82,7 +81,6 @@ TEST(LogCollection, OutcomesOfEveryCollection) {
       // System-logs trace mode 3 turns compression off for "tel" and "bb".
       {{"tel"}, {.mode = property("3")}, tel + kPath + "T1-*\n"},
       {{"bb"}, {.mode = property("0x3")}, running + "T1-bb-trace\n"},
-      {{"tel"}, {.mode = property("lite")}, tel + kPath + "T1.tar.gz\n"},
       {{"bb"}, {.mode = empty}, running + "T1.tar.gz\n"},
       {{"tel"}, {.mode = failed(kResultTimeout)}, tel + kPath + "T1.tar.gz\n"},
       {{"bb"}, {.mode = ok(MessageValue::string("3"))}, running + "T1.tar.gz\n"},
@@ -130,12 +128,6 @@ TEST(LogCollection, RequestsFollowTheWordsInKeyOrder) {
       R"(TraceDumpState async {"BasebandResetType": "Hard", "BasebandResetSubType": )"
       R"("OtherErrors", "TraceAction": "CollectTelephonyLogsWithCoredump", )";
   const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
-      {{"tel"},
-       {mode, tel + R"("TraceDumpStateReason": "[halvextool] User triggered", )"
-                    R"("TraceDumpStatePerformCompression": true})"}},
-      {{"tel", "nocompress", "nonui", "crash1"},
-       {tel + R"("TraceDumpStateReason": "[halvextool] crash1", )"
-              R"("TraceDumpStatePerformCompression": false, "TraceUserConfirmation": false})"}},
       {{"core", "nonui", "why"},
        {core + R"("BasebandResetReason": "[halvextool] why", )"
                R"("TraceDumpStatePerformCompression": true, "TraceUserConfirmation": false})"}},

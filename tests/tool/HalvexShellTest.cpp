@@ -4,6 +4,7 @@
 #include <chrono>
 #include <set>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "Tools/HalvexTool/HalvexShell.h"

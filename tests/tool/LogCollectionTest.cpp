@@ -7,7 +7,6 @@
 #include <string>
 #include <vector>
 
-#include "Tools/HalvexTool/DumpOptions.h"
 #include "tests/tool/ToolTestSupport.h"
 
 namespace halvex {
@@ -121,9 +120,6 @@ TEST(LogCollection, OutcomesOfEveryCollection) {
 // Each request as "command sync|async {keys}", so that a row states every request in order.
 TEST(LogCollection, RequestsFollowTheWordsInKeyOrder) {
   ServerScript().install();
-  const std::string mode =
-      R"(GetTraceProperty sync {"TraceName": "SystemLogs", "TracePropertyName": "Mode"})";
-  const std::string tel = R"(TraceDumpState async {"TraceAction": "CollectTelephonyLogs", )";
   const std::string core =
       R"(TraceDumpState async {"BasebandResetType": "Hard", "BasebandResetSubType": )"
       R"("OtherErrors", "TraceAction": "CollectTelephonyLogsWithCoredump", )";

@@ -132,8 +132,8 @@ TEST(ToolSession, InteractiveRuns) {
 // The simulator keeps processes with the names it is given alive while it runs.
 TEST(DaemonCheck, EitherDaemonByItsExactNameLetsTheToolStart) {
   if (::getpid() != 1) {
-    GTEST_SKIP() << "needs a pid namespace of its own, so that no other process on the machine "
-                    "can be named like a daemon; run the suite as root";
+    GTEST_SKIP() << "needs a pid namespace of its own, where no other process can be named like a "
+                    "daemon: ctest run as root makes one (tests/own-pid-namespace.sh)";
   }
   const auto product57 = [](const std::string& processes) {
     return R"({"device": {"product_type": 57}, "processes": )" + processes +

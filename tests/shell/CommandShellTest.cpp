@@ -5,7 +5,6 @@
 #include <vector>
 
 #include "TestTree.h"
-#include "platform/WorkQueue.h"
 #include "shell/CommandShell.h"
 
 namespace halvex::testing {
@@ -41,6 +40,7 @@ struct ShellCase {
 };
 
 TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
+  const std::string huge(10 << 20, 'w');
   const ShellCase cases[] = {
       // One-shot mode: the first failing command ends the run.
       {{"t", "logdump", "tel", "a", "help", "cd", "--", "logdump", "bb"},
@@ -56,7 +56,6 @@ TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
       {{"t", "logdump", "cd", ".."}, "", true, ""},
       {{"t", "cd", "logdump", "--", "tel"}, "", false, invalid("tel") + R},
       {{"t", "--"}, "", true, ""},
-      {{"t", "--", "--", "logdump", "tel", "--", "--"}, "", true, "tel()\n"},
       {{"t", "logdump", "tel", "--", "x"}, "", false, "tel()\n" + invalid("x") + R},
       {{"t", "logdump", "tel", "fail", "--", "logdump", "bb"}, "", false, "tel(fail)\n"},
       {{"t", "help"}, "", true, R},
@@ -95,9 +94,14 @@ TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
        "refused logdump\n",
        "logdump"},
       {{"t"}, "cd d\n", false, prompt("/r") + prompt("/r/dup"), "", "", makeShadowTree},
-      // Bytes that are not whitespace belong to words; CR separates like any whitespace.
+      // A 10 MB word stays whole, unknown or as an argument.
       {{"t"},
-       "logdump\rtel\r\nlogdump bb -- logdump core\r\nte\0l\n\xff\n"s,
+       huge + "\nlogdump tel " + huge + "\n",
+       false,
+       P + invalid(huge) + R + P + "tel(" + huge + ")\n" + P},
+      // Bytes that are not ASCII whitespace belong to words; CR, VT and FF separate words.
+      {{"t"},
+       "logdump\rtel\r\nlogdump\vbb -- logdump\fcore\r\nte\0l\n\xff\n"s,
        false,
        P + "tel()\n" + P + "bb()\ncore()\n" + P + invalid("te\0l"s) + R + P + invalid("\xff") + R +
            P},
@@ -107,7 +111,7 @@ TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
     for (const std::string& arg : c.args) {
       trace += "[" + arg + "]";
     }
-    SCOPED_TRACE(trace + " input: " + c.input);
+    SCOPED_TRACE(trace + " input: " + c.input.substr(0, 100));
     const auto root = c.tree();
     root->vetoed.insert(c.veto);
     if (const auto logdump =
@@ -122,68 +126,8 @@ TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
 }
 
 TEST(CommandShellTest, MissingRootEndsTheRunSilently) {
-  for (const std::vector<std::string>& args : {std::vector<std::string>{"t"}, {"t", "help"}}) {
-    const ShellRun run = runShell(nullptr, args, "help\nquit\n");
-    EXPECT_FALSE(run.ok);
-    EXPECT_EQ(run.out, "");
-  }
-}
-
-TEST(CommandShellTest, HugeLinesAreSplitAndPassedWhole) {
-  const std::string huge(10 << 20, 'w');
-  std::string many;
-  for (int i = 0; i < (1 << 20); ++i) {
-    many += "arg" + std::to_string(i % 10) + "\t";
-  }
-  std::vector<std::pair<std::size_t, std::string>> received;  // argument count, last argument
-  const auto root = TestCommand::create("big", {}, [&received](TestCommand& big) {
-    big.addOption(
-        "take",
-        [&received](TaskGroup, std::vector<std::string> args) {
-          received.emplace_back(args.size(), args.back());
-          return true;
-        },
-        "");
-  });
-
-  const ShellRun run = runShell(root, {"t"}, huge + "\ntake " + many + "\ntake " + huge);
-  EXPECT_FALSE(run.ok);
-  const std::string bigHelp =
-      "\nOptions for command '\x1b[32mbig\x1b[39m':\n\n"
-      "\t            take  -  ...\n\n" +
-      kBuiltinsHelp;
-  EXPECT_EQ(run.out, prompt("/big") + invalid(huge) + bigHelp + prompt("/big") + prompt("/big") +
-                         prompt("/big"));
-  EXPECT_EQ(received,
-            (std::vector<std::pair<std::size_t, std::string>>{{1U << 20, "arg5"}, {1U, huge}}));
-}
-
-// Completions print from the queue; the shell waits for them before it prompts again.
-TEST(CommandShellTest, OutputOfAsynchronousWorkPrecedesTheNextPrompt) {
-  const WorkQueue queue = WorkQueue::create("shell.test");
-  const auto root = TestCommand::create("q", {}, [&queue](TestCommand& q) {
-    q.addOption(
-        "later",
-        [&queue](TaskGroup group, std::vector<std::string> args) {
-          queue.post([hold = TaskGroupHold(group), args] {
-            writeLine(consoleOut(), "done " + args.at(0));
-          });
-          return true;
-        },
-        "");
-  });
-  const ShellRun run = runShell(root, {"t"}, "later 1 -- later 2\nlater 3\n");
-  EXPECT_EQ(run.out, prompt("/q") + "done 1\ndone 2\n" + prompt("/q") + "done 3\n" + prompt("/q"));
-}
-
-TEST(CommandShellTest, SplittingRules) {
-  EXPECT_EQ(CommandShell::splitWords(" \t\n\v\f\ra\"b\\  'c'\0\xff \r"s),
-            (std::vector<std::string>{"a\"b\\", "'c'\0\xff"s}));
-  EXPECT_EQ(CommandShell::splitWords(" \t\r\n"), std::vector<std::string>{});
-  EXPECT_EQ(CommandShell::splitCommands({"--", "a", "--", "--", "b", "c", "--"}),
-            (std::vector<std::vector<std::string>>{{"a"}, {"b", "c"}}));
-  EXPECT_EQ(CommandShell::splitPath("//a//b/", '/'), (std::vector<std::string>{"a", "b"}));
-  EXPECT_EQ(CommandShell::splitPath("/", '/'), std::vector<std::string>{});
+  EXPECT_FALSE(runShell(nullptr, {"t"}, "help\nquit\n").ok);
+  EXPECT_EQ(runShell(nullptr, {"t", "help"}).out, "");
 }
 
 }  // namespace

@@ -20,15 +20,13 @@ namespace halvex::testing {
 class TestCommand : public CommandBase {
  public:
   using Setup = std::function<void(TestCommand&)>;
-
-  TestCommand(std::string name, std::weak_ptr<CommandBase> parent, Setup setup)
-      : CommandBase(std::move(name), std::move(parent)), setup_(std::move(setup)) {}
+  using CommandBase::CommandBase;
 
   static std::shared_ptr<TestCommand> create(std::string name,
                                              std::weak_ptr<CommandBase> parent = {},
                                              Setup setup = {}) {
-    auto command =
-        std::make_shared<TestCommand>(std::move(name), std::move(parent), std::move(setup));
+    auto command = std::make_shared<TestCommand>(std::move(name), std::move(parent));
+    command->setup_ = std::move(setup);
     command->init();
     return command;
   }
@@ -87,10 +85,7 @@ inline std::shared_ptr<TestCommand> makeToolTree() {
 
 inline const std::string kBuiltinsHelp =
     "\t              cd  -  <sub-command>\n"
-    "\t            help\n"
-    "\t            back\n"
-    "\t            quit\n"
-    "\n";
+    "\t            help\n\t            back\n\t            quit\n\n";
 
 inline const std::string kRootHelp =
     "\nOptions for command '\x1b[32mhalvextool\x1b[39m':\n\n"
@@ -112,30 +107,21 @@ inline std::string prompt(const std::string& path) {
   return "(" + path + ")>> ";
 }
 
-class TestShell : public CommandShell {
- public:
-  explicit TestShell(std::shared_ptr<CommandBase> root) : root_(std::move(root)) {}
-
- protected:
-  std::shared_ptr<CommandBase> createRootCommand() override { return root_; }
-
- private:
-  std::shared_ptr<CommandBase> root_;
-};
-
 struct ShellRun {
   bool ok;
-  std::string out;
-  std::string err;
+  std::string out, err;
 };
 
 inline ShellRun runShell(std::shared_ptr<CommandBase> root, std::vector<std::string> args,
                          const std::string& input = "") {
+  struct Shell : CommandShell {
+    std::shared_ptr<CommandBase> root;
+    std::shared_ptr<CommandBase> createRootCommand() override { return root; }
+  } shell;
+  shell.root = std::move(root);
   std::istringstream in(input);
-  std::ostringstream out;
-  std::ostringstream err;
+  std::ostringstream out, err;
   ScopedConsoleForTesting console(in, out, err);
-  TestShell shell(std::move(root));
   const bool ok = shell.run(std::move(args));
   return {ok, out.str(), err.str()};
 }

@@ -1,11 +1,12 @@
 // SPDX-License-Identifier: MIT
-// Shared pieces of the tool's unit tests: captured console streams, a fake server script and a
+// Shared by the tool's unit tests: captured console streams, a fake server script and a
 // "logdump" command wired to the fake platform.
 #pragma once
 
 #include <memory>
 #include <sstream>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Tools/HalvexTool/LogdumpCommand.h"
@@ -18,9 +19,7 @@
 
 namespace halvex::tooltest {
 
-// Redirects the console for the object's lifetime.
 struct CapturedConsole {
-  explicit CapturedConsole(const std::string& input = {}) : in(input) {}
   std::istringstream in;
   std::ostringstream out;
   std::ostringstream err;
@@ -43,19 +42,15 @@ inline fake::Answer failed(std::int32_t code) {
   return {Result{code, "failed"}, {}};
 }
 
-inline fake::Answer propertyValue(const std::string& text) {
-  return ok(dictOf({{kKeyTracePropertyValue, MessageValue::string(text)}}));
-}
-
-inline fake::Answer dumped(const std::string& timestamp) {
-  return ok(dictOf({{kKeyTimestampString, MessageValue::string(timestamp)}}));
+inline fake::Answer valued(const char* key, const std::string& text) {
+  return ok(dictOf({{key, MessageValue::string(text)}}));
 }
 
 // How the fake server answers each of the three requests the collections make.
 struct ServerScript {
-  fake::Answer enabled = propertyValue("1");
-  fake::Answer mode = propertyValue("0");
-  fake::Answer dump = dumped("T1");
+  fake::Answer enabled = valued(kKeyTracePropertyValue, "1");
+  fake::Answer mode = valued(kKeyTracePropertyValue, "0");
+  fake::Answer dump = valued(kKeyTimestampString, "T1");
 
   void install() const {
     fake::FakePlatform::get().setServerResponder(
@@ -70,16 +65,10 @@ struct ServerScript {
 
 inline std::shared_ptr<LogdumpCommand> makeLogdump() {
   WorkQueue queue = WorkQueue::create("test.queue");
-  auto manager = client::CreateManager("halvextool", queue);
-  return LogdumpCommand::create("logdump", {}, manager, queue);
+  return LogdumpCommand::create("logdump", {}, client::CreateManager("halvextool", queue), queue);
 }
 
-// The server requests made since `from` requests had been recorded.
-inline std::vector<fake::ServerRequest> requestsSince(std::size_t from) {
-  auto all = fake::FakePlatform::get().serverRequests();
-  return {all.begin() + static_cast<std::ptrdiff_t>(from), all.end()};
-}
-
-inline const char* const kSnapshot = "/var/wireless/Library/Logs/Faultkeep/Baseband/log-bb-";
+inline const std::string kPath = "Path = /var/wireless/Library/Logs/Faultkeep/Baseband/log-bb-";
+inline const std::string kRefusal = "Server is not running. Please try after server starts.\n";
 
 }  // namespace halvex::tooltest

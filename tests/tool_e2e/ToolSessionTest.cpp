@@ -1,213 +1,154 @@
 // SPDX-License-Identifier: MIT
+// The real halvextool against halvex-sim on a private bus, each run compared whole: exit status,
+// both output streams and the requests the simulated device received.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <string>
+#include <vector>
 
-#include "tests/tool_e2e/ToolRun.h"
+#include "tests/support/TestBus.h"
 
 namespace halvex::e2e {
 namespace {
 
-using nlohmann::json;
+const std::string kPrompt = "(/halvextool)>> ";
+const std::string kPath = "Path = /var/wireless/Library/Logs/Faultkeep/Baseband/log-bb-";
+const std::string kTel = "Telephony log collection: ";
+const std::string kModeQuery =
+    "halvextool GetTraceProperty TraceName='SystemLogs' TracePropertyName='Mode'";
+const std::string kTelDump =
+    "halvextool TraceDumpState TraceAction='CollectTelephonyLogs' "
+    "TraceDumpStateReason='[halvextool] User triggered' TraceDumpStatePerformCompression=true";
 
-TEST(ToolSession, NoRadioRefusesToStart) {
-  test::PrivateBus bus;
-  // Without the device service the host has no radio.
-  test::SimProcess sim(bus, R"({"device": {"present": false}, "processes": []})");
-  const test::RunResult run = runTool({"logdump", "tel"});
-  EXPECT_EQ(run.status.describe(), "exit 255");
-  EXPECT_EQ(run.out, "'halvextool' is not supported on this product.\n");
-  EXPECT_EQ(run.err, "");
-  EXPECT_TRUE(commandRequests(sim).empty());
-}
-
-TEST(ToolSession, OneShotTelephonyWithReasonAndNonui) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"timestamp": "20261122-101500"}}}})");
-  // One argument with a space stays one word: the reason.
-  const test::RunResult run = runTool({"logdump", "tel", "nonui", "modem stuck"});
-  EXPECT_EQ(run.status.describe(), "exit 0");
-  EXPECT_EQ(run.out,
-            "Telephony log collection: Success\nPath = " + kSnapshot + "20261122-101500.tar.gz\n");
-  EXPECT_EQ(run.err, "");
-  EXPECT_EQ(
-      commandRequests(sim),
-      (std::vector<json>{
-          modeQuery(),
-          serverRequest("TraceDumpState", {key("TraceAction", "CollectTelephonyLogs"),
-                                           key("TraceDumpStateReason", "[halvextool] modem stuck"),
-                                           key("TraceDumpStatePerformCompression", true),
-                                           key("TraceUserConfirmation", false)}),
-      }));
-}
-
-// A reason that is not UTF-8 cannot be sent as a string: the dump still goes, with a null reason.
-TEST(ToolSession, AReasonTheBusCannotCarryTravelsAsNull) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"timestamp": "T2"}}}})");
-  const test::RunResult run = runTool({"logdump", "tel", "nocompress", "caf\xe9"});
-  EXPECT_EQ(run.status.describe(), "exit 0");
-  EXPECT_EQ(run.out, "Telephony log collection: Success\nPath = " + kSnapshot + "T2-*\n");
-  EXPECT_EQ(run.err, "");
-  EXPECT_EQ(commandRequests(sim),
-            (std::vector<json>{serverRequest(
-                "TraceDumpState",
-                {key("TraceAction", "CollectTelephonyLogs"),
-                 {{"key", "TraceDumpStateReason"}, {"type", "null"}, {"value", nullptr}},
-                 key("TraceDumpStatePerformCompression", false)})}));
-}
-
-TEST(ToolSession, OneShotCoredumpInSystemLogsMode3) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"timestamp": "T7"}},
-               "properties": {"SystemLogs": {"Mode": {"value": "0x3"}}}}})");
-  const test::RunResult run = runTool({"logdump", "core", "nocompress", "crash1", "nonui"});
-  EXPECT_EQ(run.status.describe(), "exit 0");
-  EXPECT_EQ(run.out,
-            "Telephony log collection with Coredump: Success\nPath = " + kSnapshot + "T7-*\n");
-  EXPECT_EQ(run.err, "");
-  // No mode query, and "nonui" after the reason is not an option any more.
-  EXPECT_EQ(commandRequests(sim),
-            (std::vector<json>{serverRequest(
-                "TraceDumpState",
-                {key("BasebandResetType", "Hard"), key("BasebandResetSubType", "OtherErrors"),
-                 key("TraceAction", "CollectTelephonyLogsWithCoredump"),
-                 key("BasebandResetReason", "[halvextool] crash1"),
-                 key("TraceDumpStatePerformCompression", false)})}));
-}
-
-TEST(ToolSession, ServerAbsentRefusesTelephonyAndFailsBaseband) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(, "server": {"present": false}})");
-  const test::RunResult tel = runTool({"logdump", "tel"});
-  EXPECT_EQ(tel.status.describe(), "exit 1");
-  EXPECT_EQ(tel.out, "");
-  EXPECT_EQ(tel.err, kRefusal);
-  // "bb" is never refused, but it cannot learn whether baseband logs are enabled.
-  const test::RunResult bb = runTool({"logdump", "bb"});
-  EXPECT_EQ(bb.status.describe(), "exit 1");
-  EXPECT_EQ(bb.out, "Baseband log collection: Failed\n");
-  EXPECT_EQ(bb.err, "");
-  EXPECT_TRUE(commandRequests(sim).empty());
-}
-
-TEST(ToolSession, BasebandFallsBackToTheHelperWhenTheServerReportsItselfDown) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"result": -534716415}}},
-    "helper": {"timestamp": "20261122-090000"}})");
-  const test::RunResult run = runTool({"logdump", "bb"});
-  EXPECT_EQ(run.status.describe(), "exit 0");
-  // Vendor 2 folders end in "-diag"; compression plays no part without the server.
-  EXPECT_EQ(run.out, "Baseband log collection: Success (Halvex not running)\nPath = " + kSnapshot +
-                         "20261122-090000-diag\n");
-  EXPECT_EQ(run.err, "");
-  const auto requests = commandRequests(sim);
-  ASSERT_EQ(requests.size(), 4u);
-  EXPECT_EQ(requests[0], serverRequest("GetTraceProperty", {key("TraceName", "BasebandTrace"),
-                                                            key("TracePropertyName", "Enabled")}));
-  EXPECT_EQ(requests[1], modeQuery());
-  EXPECT_EQ(requests[2]["command"], "TraceDumpState");
-  EXPECT_EQ(requests[3],
-            (json{{"service", "helper"},
-                  {"method", "Perform"},
-                  {"client", "logdump.helper"},
-                  {"task", 4},
-                  {"command", "VarniskStatus"},
-                  {"keys", {{{"key", "Timeout"}, {"type", "int64"}, {"value", 1500}}}}}));
-}
-
-TEST(ToolSession, InteractiveSessionNavigatesAndCollects) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"timestamp": "T1"}}}})");
-  const test::RunResult run =
-      runTool({}, "\nlogdump tel nocompress\ncd logdump\nbb nocompress -- back\nhelp\nquit\n");
-  EXPECT_EQ(run.status.describe(), "exit 0");
-  const std::string inLogdump = "(/halvextool/logdump)>> ";
-  EXPECT_EQ(
-      run.out,
-      kPrompt + kPrompt + "Telephony log collection: Success\nPath = " + kSnapshot + "T1-*\n" +
-          kPrompt + inLogdump + "Baseband log collection: Success (Halvex running)\nPath = " +
-          kSnapshot + "T1-diag\n" + kPrompt + "\nOptions for command '\x1b[32mhalvextool" +
-          "\x1b[39m':\n\n\t" + std::string(9, ' ') + "logdump  -  [bb|core|tel]\n\n\t" +
-          std::string(14, ' ') + "cd  -  <sub-command>\n\t" + std::string(12, ' ') + "help\n\t" +
-          std::string(12, ' ') + "back\n\t" + std::string(12, ' ') + "quit\n\n" + kPrompt);
-  EXPECT_EQ(run.err, "");
-  const auto requests = commandRequests(sim);
-  ASSERT_EQ(requests.size(), 3u);
-  EXPECT_EQ(requests[0]["keys"][2], key("TraceDumpStatePerformCompression", false));
-  EXPECT_EQ(requests[1]["command"], "GetTraceProperty");
-  EXPECT_EQ(requests[2]["keys"][1], key("TraceAction", "CollectBasebandLogs"));
-}
-
-TEST(ToolSession, InteractiveEndOfInputFails) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + "}");
-  const test::RunResult run = runTool({}, "logdump");
-  EXPECT_EQ(run.status.describe(), "exit 1");
-  // "logdump" alone shows its help and fails; end of input then ends the run without a newline.
-  EXPECT_TRUE(run.out.starts_with(kPrompt + "\nOptions for command '\x1b[32mlogdump\x1b[39m':\n"))
-      << run.out;
-  EXPECT_TRUE(run.out.ends_with("quit\n\n" + kPrompt)) << run.out;
-  EXPECT_EQ(run.err, "");
-}
-
-TEST(ToolSession, ServerThatAppearsLaterIsUsedOnceItReportsItsState) {
-  test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"present": false, "commands": {"TraceDumpState": {"timestamp": "T3"}}}})");
-  InteractiveTool tool;
-  tool.send("logdump tel\n");
-  ASSERT_TRUE(tool.waitUntil([](auto&, const std::string& err) { return err == kRefusal; }))
-      << tool.err();
-
-  ASSERT_EQ(sim.callControl("SetServerPresent", "b", {"true"}).status.describe(), "exit 0");
-  // The state event comes through the tool's own subscription; retry until it has landed.
-  const std::string success =
-      "Telephony log collection: Success\nPath = " + kSnapshot + "T3.tar.gz\n";
-  bool collected = false;
-  for (int attempt = 0; attempt < 50 && !collected; ++attempt) {
-    const std::size_t refusals = occurrences(tool.err(), kRefusal);
-    tool.send("logdump tel\n");
-    ASSERT_TRUE(tool.waitUntil([&](const std::string& out, const std::string& err) {
-      return out.ends_with(success + kPrompt) || occurrences(err, kRefusal) > refusals;
-    }));
-    collected = tool.out().ends_with(success + kPrompt);
-    if (!collected) {
-      std::this_thread::sleep_for(100ms);
+std::vector<std::string> commandRequests(const test::SimProcess& sim) {
+  std::vector<std::string> lines;
+  for (const nlohmann::json& entry : sim.requestLog()) {
+    if (!entry.contains("command")) {
+      continue;  // subscriptions and device identity queries
     }
+    std::string line = entry.value("client", "") + " " + entry.value("command", "");
+    line += entry.contains("task") ? " task=" + entry["task"].dump() : "";
+    for (const nlohmann::json& key : entry["keys"]) {
+      const nlohmann::json& value = key["value"];
+      line += " " + key.value("key", "") + "=" +
+              (value.is_string() ? "'" + value.get<std::string>() + "'" : value.dump());
+    }
+    lines.push_back(line);
   }
-  ASSERT_TRUE(collected) << tool.out() << tool.err();
-  tool.send("quit\n");
-  EXPECT_EQ(tool.finish().describe(), "exit 0");
-  // Every refused attempt showed its prompt and nothing else.
-  const std::size_t refusals = occurrences(tool.err(), kRefusal);
-  std::string expected;
-  for (std::size_t i = 0; i <= refusals; ++i) {
-    expected += kPrompt;
-  }
-  EXPECT_EQ(tool.out(), expected + success + kPrompt);
-  EXPECT_EQ(tool.err().size(), refusals * kRefusal.size());
+  return lines;
 }
 
-TEST(ToolSession, ServerDyingDuringTelephonyCollectionFailsWithoutHanging) {
+// Runs the tool with words, or interactively (no words) reading input to its end, on a device
+// that plays scenario, and compares everything. Requests read "client command key=value ...",
+// strings in single quotes.
+void runSession(const char* what, const std::string& scenario, std::vector<std::string> words,
+                const std::string& input, const std::string& status, const std::string& out,
+                const std::string& err, const std::vector<std::string>& requests) {
+  SCOPED_TRACE(what);
   test::PrivateBus bus;
-  test::SimProcess sim(bus, "{" + kExemptDevice + R"(,
-    "server": {"commands": {"TraceDumpState": {"fault": "exit"}}}})");
-  InteractiveTool tool;
-  tool.send("logdump tel\n");
-  ASSERT_TRUE(tool.waitUntil([](const std::string& out, auto&) {
-    return out.ends_with("Telephony log collection: Failed\n" + kPrompt);
-  })) << tool.out();
-  EXPECT_TRUE(sim.waitExit().exited);
-  tool.send("quit\n");
-  EXPECT_EQ(tool.finish().describe(), "exit 0");
-  EXPECT_EQ(tool.out(), kPrompt + "Telephony log collection: Failed\n" + kPrompt);
-  EXPECT_EQ(tool.err(), "");
+  test::SimProcess sim(bus, scenario);
+  words.insert(words.begin(), HALVEXTOOL_BINARY);
+  const test::RunResult run = test::runProcess({.args = words, .env = {}, .input = input});
+  EXPECT_EQ(run.status.describe(), status);
+  EXPECT_EQ(run.out, out);
+  EXPECT_EQ(run.err, err);
+  EXPECT_EQ(commandRequests(sim), requests);
+}
+
+// Product 58 needs neither daemon, so these runs do not depend on the process table.
+std::string exempt(const std::string& server) {
+  return R"({"device": {"product_type": 58}, "server": )" + server + "}";
+}
+
+std::string stamped(const std::string& timestamp) {
+  return exempt(R"({"commands": {"TraceDumpState": {"timestamp": ")" + timestamp + R"("}}})");
+}
+
+const std::string kEnabledQuery =
+    "halvextool GetTraceProperty TraceName='BasebandTrace' TracePropertyName='Enabled'";
+const std::string kRunning = "Baseband log collection: Success (Halvex running)\n";
+const std::string kRefusal = "Server is not running. Please try after server starts.\n";
+
+std::string bbDump(const char* compression, const char* reason = "User triggered") {
+  return std::string("halvextool TraceDumpState TraceDumpStateReason='[halvextool] ") + reason +
+         "' TraceAction='CollectBasebandLogs' TraceDumpStatePerformCompression=" + compression;
+}
+
+TEST(ToolSession, OneShotRuns) {
+  runSession("no radio", R"({"device": {"present": false}})", {"logdump", "tel"}, "", "exit 255",
+             "'halvextool' is not supported on this product.\n", "", {});
+  // An argument that is not UTF-8 travels as null.
+  runSession("unsendable reason", stamped("T2"), {"logdump", "tel", "nonui", "caf\xe9"}, "",
+             "exit 0", kTel + "Success\n" + kPath + "T2.tar.gz\n", "",
+             {kModeQuery,
+              "halvextool TraceDumpState TraceAction='CollectTelephonyLogs' "
+              "TraceDumpStateReason=null TraceDumpStatePerformCompression=true "
+              "TraceUserConfirmation=false"});
+  runSession("no server, telephony", exempt(R"({"present": false})"), {"logdump", "tel"}, "",
+             "exit 1", "", kRefusal, {});
+  // An argument with a space stays one word.
+  runSession("helper fallback", exempt(R"({"commands": {"TraceDumpState": {"result": -534716415}}},
+                                          "helper": {"timestamp": "H9"})"),
+             {"logdump", "bb", "modem stuck"}, "", "exit 0",
+             "Baseband log collection: Success (Halvex not running)\n" + kPath + "H9-diag\n", "",
+             {kEnabledQuery, kModeQuery, bbDump("true", "modem stuck"),
+              "logdump.helper VarniskStatus task=4 Timeout=1500"});
+}
+
+TEST(ToolSession, InteractiveRuns) {
+  const std::string inLogdump = "(/halvextool/logdump)>> ";
+  runSession("navigation", stamped("T1"), {},
+             "\nlogdump tel nocompress\ncd logdump\nhelp\nbb nocompress -- back\nquit\n", "exit 0",
+             kPrompt + kPrompt + kTel + "Success\n" + kPath + "T1-*\n" + kPrompt + inLogdump +
+                 "\nOptions for command '\x1b[32mlogdump\x1b[39m':\n\n"
+                 "\t              bb  -  [nocompress] <reason> collect baseband logs only\n\n"
+                 "\t            core  -  [nocompress] [nonui] <reason> collect telephony logs "
+                 "with coredump\n\n"
+                 "\t             tel  -  [nocompress] [nonui] <reason> collect telephony logs\n\n"
+                 "\t              cd  -  <sub-command>\n\t            help\n\t            back\n"
+                 "\t            quit\n\n" +
+                 inLogdump + kRunning + kPath + "T1-diag\n" + kPrompt,
+             "",
+             {"halvextool TraceDumpState TraceAction='CollectTelephonyLogs' TraceDumpStateReason="
+              "'[halvextool] User triggered' TraceDumpStatePerformCompression=false",
+              kEnabledQuery, bbDump("false")});
+  // The server takes its name during the start-up wait and reports its state after it, while
+  // the baseband query is kept waiting: the second "tel" finds the server started.
+  runSession("state after the wait",
+             exempt(R"({"appear_after_ms": 300, "commands": {"TraceDumpState": {"timestamp": "T3"}},
+      "state": {"payload": {"ServerState": "Started"}, "when": "after", "after_ms": 1000},
+      "properties": {"BasebandTrace": {"Enabled": {"value": "1", "delay_ms": 2000}}}})"),
+             {}, "logdump tel\nlogdump bb\nlogdump tel\nquit\n", "exit 0",
+             kPrompt + kPrompt + kRunning + kPath + "T3.tar.gz\n" + kPrompt + kTel + "Success\n" +
+                 kPath + "T3.tar.gz\n" + kPrompt,
+             kRefusal, {kEnabledQuery, kModeQuery, bbDump("true"), kModeQuery, kTelDump});
+  runSession("server dies during a dump",
+             exempt(R"({"commands": {"TraceDumpState": {"fault": "exit"}}})"), {},
+             "logdump tel\nquit\n", "exit 0", kPrompt + kTel + "Failed\n" + kPrompt, "",
+             {kModeQuery, kTelDump});
+}
+
+// The simulator keeps processes with the names it is given alive while it runs.
+TEST(DaemonCheck, EitherDaemonByItsExactNameLetsTheToolStart) {
+  if (::getpid() != 1) {
+    GTEST_SKIP() << "needs a pid namespace of its own, where no other process can be named like a "
+                    "daemon: ctest run as root makes one (tests/own-pid-namespace.sh)";
+  }
+  const auto product57 = [](const std::string& processes) {
+    return R"({"device": {"product_type": 57}, "processes": )" + processes +
+           R"(, "server": {"commands": {"TraceDumpState": {"timestamp": "T"}}}})";
+  };
+  const std::string started = kTel + "Success\n" + kPath + "T.tar.gz\n";
+  runSession(
+      "neither", product57(R"(["telvane", "Kelmond", "Telvane2"])"), {"logdump", "tel"}, "",
+      "exit 255",
+      "Telvane process is not running. Please run/load Telvane (or kelmond) and try again.\n", "",
+      {});
+  for (const char* daemon : {"Telvane", "kelmond"}) {
+    runSession(daemon, product57(std::string("[\"") + daemon + "\"]"), {"logdump", "tel"}, "",
+               "exit 0", started, "", {kModeQuery, kTelDump});
+  }
 }
 
 }  // namespace

@@ -146,7 +146,7 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
             R"({"key":"a","type":"string","value":"inner"}]}])");
   EXPECT_EQ(client::PerformCommand(manager_, "Refused", {}, reply).code, 7);
   EXPECT_EQ(reply, MessageValue::string("kept"));
-  for (const std::string command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')})
+  for (const std::string& command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')})
     EXPECT_EQ(client::PerformCommand(manager_, command, {}, reply).code, kResultInvalidRequest);
   MessageDict badKey;
   badKey.set("\xff", MessageValue::null());

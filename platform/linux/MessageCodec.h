@@ -4,9 +4,9 @@
 // given, so they run on whichever thread owns that message's bus.
 //
 // Encoding checks the whole value before it appends anything, so a value that cannot be sent
-// leaves the message as it was: never half-built. Decoding stops at the first fault; the message's read position is
-// then wherever the fault was found and the caller should treat the whole message as bad. Decoded
-// output is only complete when the call returns 0.
+// leaves the message as it was: never half-built. Decoding stops at the first fault; the message's
+// read position is then wherever the fault was found and the caller should treat the whole message
+// as bad. Decoded output is only complete when the call returns 0.
 #pragma once
 
 #include <systemd/sd-bus.h>

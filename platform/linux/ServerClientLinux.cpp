@@ -149,7 +149,7 @@ struct SlotReleaser {
 };
 using SlotPtr = std::unique_ptr<sd_bus_slot, SlotReleaser>;
 
-bus::CallSpec commandSpec(const std::string& command) {
+bus::CallPlan commandPlan(const std::string& command) {
   return {bus::kServerName,
           bus::kServerPath,
           bus::kServerInterface,
@@ -241,7 +241,7 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore>,
     }
     MessageValue value;
     Result result = ProcessBus::instance().call(
-        commandSpec(command),
+        commandPlan(command),
         [&](sd_bus_message* message) { return appendRequest(message, command, request); },
         [&value](sd_bus_message* answer) { return bus::readOutcome(answer, value); });
     reply = std::move(value);
@@ -336,7 +336,7 @@ class ManagerCore : public std::enable_shared_from_this<ManagerCore>,
       return;
     }
     ProcessBus::instance().callAsync(
-        commandSpec(call->command),
+        commandPlan(call->command),
         [this, &call](sd_bus_message* message) {
           return appendRequest(message, call->command, call->request);
         },

@@ -229,7 +229,7 @@ void ProcessBus::send(Task task) {
   }
 }
 
-Result ProcessBus::call(const CallSpec& spec, const MessageBuilder& build, const Decoder& decode) {
+Result ProcessBus::call(const CallPlan& plan, const MessageBuilder& build, const Decoder& decode) {
   if (tIoContext) {
     return makeResult(kResultBusError, "synchronous call from the bus's own context");
   }
@@ -239,8 +239,8 @@ Result ProcessBus::call(const CallSpec& spec, const MessageBuilder& build, const
   };
   // Shared with the completion: the waiter may wake and return before notify_one() has.
   auto outcome = std::make_shared<Outcome>();
-  Task send = [this, &spec, &build, &decode, outcome] {
-    callAsync(spec, build, [&decode, outcome](const Result& failure, sd_bus_message* reply) {
+  Task send = [this, &plan, &build, &decode, outcome] {
+    callAsync(plan, build, [&decode, outcome](const Result& failure, sd_bus_message* reply) {
       outcome->result = reply != nullptr ? decode(reply) : failure;
       outcome->done.store(true, std::memory_order_release);
       outcome->done.notify_one();
@@ -385,15 +385,15 @@ void ProcessBus::dropConnection(const char* why) {
   }
 }
 
-void ProcessBus::callAsync(const CallSpec& spec, const MessageBuilder& build, ReplyHandler done,
+void ProcessBus::callAsync(const CallPlan& plan, const MessageBuilder& build, ReplyHandler done,
                            const void* owner) {
   auto pending = std::make_unique<Pending>();
   pending->bus = this;
   pending->started = monotonicUsec();
-  pending->deadline = pending->started + static_cast<std::uint64_t>(spec.timeout.count());
+  pending->deadline = pending->started + static_cast<std::uint64_t>(plan.timeout.count());
   pending->owner = owner;
-  pending->category = spec.category;
-  pending->label = spec.label;
+  pending->category = plan.category;
+  pending->label = plan.label;
   pending->done = std::move(done);
 
   // A connection can break without our noticing until we write to it. A request that fails to
@@ -407,8 +407,8 @@ void ProcessBus::callAsync(const CallSpec& spec, const MessageBuilder& build, Re
       return;
     }
     sd_bus_message* raw = nullptr;
-    int r = sd_bus_message_new_method_call(bus, &raw, spec.destination, spec.path, spec.interface,
-                                           spec.member);
+    int r = sd_bus_message_new_method_call(bus, &raw, plan.destination, plan.path, plan.interface,
+                                           plan.member);
     if (r < 0) {
       complete(std::move(pending), resultFromErrno(bus, r), nullptr);
       return;

@@ -40,7 +40,7 @@
 namespace halvex::bus {
 
 // What one call is: where it goes, how long it may take, and how it is named in the log.
-struct CallSpec {
+struct CallPlan {
   const char* destination;
   const char* path;
   const char* interface;
@@ -97,7 +97,7 @@ class ProcessBus {
 
   // Any thread but the loop's: sends the call and blocks until it completes. decode runs on the
   // method return in the I/O context; its Result is returned. Failures come back as Results.
-  Result call(const CallSpec& spec, const MessageBuilder& build, const Decoder& decode);
+  Result call(const CallPlan& plan, const MessageBuilder& build, const Decoder& decode);
 
   // --- I/O context only ---
 
@@ -111,7 +111,7 @@ class ProcessBus {
 
   // Sends a call with auto-start off. done runs exactly once in the I/O context, possibly before
   // callAsync returns. owner tags the call for cancel(); it may be null.
-  void callAsync(const CallSpec& spec, const MessageBuilder& build, ReplyHandler done,
+  void callAsync(const CallPlan& plan, const MessageBuilder& build, ReplyHandler done,
                  const void* owner = nullptr);
 
   // Completes owner's pending calls now with why.

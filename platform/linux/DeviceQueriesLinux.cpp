@@ -121,16 +121,32 @@ std::string_view baseName(std::string_view path) {
   return slash == std::string_view::npos ? path : path.substr(slash + 1);
 }
 
+// A process that has ended but is not yet reaped keeps its name; it is not running. Its state
+// follows the name in stat, after the last ")" since the name may hold one itself.
+bool hasEnded(int procFd, const std::string& pid) {
+  std::string stat;
+  if (!readFirstField(procFd, pid + "/stat", '\n', stat)) {
+    return true;
+  }
+  const std::size_t close = stat.rfind(')');
+  if (close == std::string::npos || close + 2 >= stat.size()) {
+    return false;
+  }
+  const char state = stat[close + 2];
+  return state == 'Z' || state == 'X';
+}
+
 bool processHasName(int procFd, const std::string& pid, const std::string& name) {
   std::string comm;
   if (!readFirstField(procFd, pid + "/comm", '\n', comm)) {
     return false;
   }
   if (name.size() < kCommLength) {
-    return comm == name;
+    return comm == name && !hasEnded(procFd, pid);
   }
   // comm holds only the first 15 bytes; a name that long is confirmed through argv[0], which the
-  // program was started under (the link's name when started through a symbolic link).
+  // program was started under (the link's name when started through a symbolic link). An ended
+  // process has no argv left.
   if (comm != std::string_view(name).substr(0, kCommLength)) {
     return false;
   }

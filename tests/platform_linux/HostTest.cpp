@@ -6,8 +6,10 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -126,6 +128,16 @@ TEST(ProcessCheckTest, FindsProcessesByTheirWholeName) {
        running() && std::chrono::steady_clock::now() < deadline;)
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   EXPECT_FALSE(running());
+  // An ended process keeps its name until it is reaped.
+  const pid_t child = fork();
+  if (child == 0) {
+    prctl(PR_SET_NAME, shortName.c_str());
+    _exit(0);
+  }
+  siginfo_t ended{};
+  ASSERT_EQ(waitid(P_PID, static_cast<id_t>(child), &ended, WEXITED | WNOWAIT), 0);
+  EXPECT_FALSE(device::isProcessRunning(shortName));
+  waitpid(child, nullptr, 0);
   EXPECT_EQ(device::getProgramName(), "platform_linux_bus_test");
 }
 

@@ -132,9 +132,10 @@ pid_t spawnChild(const std::vector<std::string>& args, const EnvChanges& env,
   for (char** entry = environ; *entry != nullptr; ++entry)
     environment.emplace_back(*entry);
   for (const auto& [name, value] : env) {
-    std::erase_if(environment, [&](const std::string& e) { return e.starts_with(name + "="); });
+    const std::string prefix = name + "=";
+    std::erase_if(environment, [&prefix](const std::string& e) { return e.starts_with(prefix); });
     if (value)
-      environment.push_back(name + "=" + *value);
+      environment.push_back(prefix + *value);
   }
   const std::vector<char*> argv = pointers(args), envp = pointers(environment);
   const pid_t parent = ::getpid();

@@ -356,6 +356,7 @@ TEST_F(ManagerTest, EventsComeOnlyFromTheServerAndOnlyWhileOn) {
   auto sent = bus_.busctl({"emit", "/org/halvex/Server", "org.halvex.Server1", "Event", "sv",
                            "Probe", "s", "impostor"});
   ASSERT_EQ(sent.status.code, 0) << sent.err;
+  ASSERT_EQ(sim_->callControl("EmitEvent", "sv", {"Unheard", "s", "x"}).status.code, 0);
   ASSERT_EQ(emit("genuine"), 0);
   ASSERT_TRUE(waitFor(1, "Probe") && barrier() && drain());
   ASSERT_EQ(mail("Probe").size(), 1u);

@@ -145,6 +145,24 @@ TEST(DevicePropertyTest, BootArgumentsAreTheKernelCommandLine) {
   std::string line;
   std::getline(std::ifstream("/proc/cmdline"), line);
   EXPECT_EQ(DevicePropertyService::create()->getPropertyMap()["boot-args"], line);
+
+  // Whatever the file holds: no more than 64 KiB of it, without its trailing terminators.
+  if (::geteuid() != 0 || ::unshare(CLONE_NEWNS) != 0 ||
+      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
+    GTEST_SKIP() << "only root can stand a file in for /proc/cmdline";
+  TempDir dir;
+  const fs::path fake = dir.path() / "cmdline";
+  const std::pair<std::string, std::string> cases[] = {
+      {std::string(70000, 'a'), std::string(64 * 1024, 'a')},
+      {std::string("quiet x=1\n\0\n", 13), "quiet x=1"},
+  };
+  for (const auto& [content, expected] : cases) {
+    std::ofstream(fake, std::ios::binary) << content;
+    ASSERT_EQ(::mount(fake.c_str(), "/proc/cmdline", nullptr, MS_BIND, nullptr), 0)
+        << std::strerror(errno);
+    EXPECT_EQ(DevicePropertyService::create()->getPropertyMap()["boot-args"], expected);
+    ::umount("/proc/cmdline");
+  }
 }
 
 // Binds the socket the journal would, in a mount namespace of its own over a fresh /run, so that

@@ -174,6 +174,13 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
   EXPECT_EQ(mail("nested")[0].result.code, 0);
   EXPECT_EQ(mail("hang")[0].result.code, kResultTimeout);
   EXPECT_EQ(mail("unsendable")[0].result.code, kResultInvalidRequest);
+
+  // A stopped loop hands the bus back: callers use it directly, and a new loop claims it again.
+  for (int i = 0; i < 2; ++i) {
+    loop_.reset();
+    EXPECT_EQ(client::PerformCommand(manager_, kCommandTraceDumpState, {}, reply).code, 0);
+    loop_.emplace();
+  }
 }
 
 // A server of our own, on its own thread: commands get the bus driver's error for an absent

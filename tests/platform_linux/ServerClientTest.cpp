@@ -188,6 +188,7 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
 class RogueServer {
  public:
   static constexpr int kListed = 300;
+  static constexpr int kFlood = 1100;  // events a "Flood" command sends before its answer
 
   // True once it owns the name.
   bool ready() { return ready_.get_future().get(); }
@@ -206,6 +207,15 @@ class RogueServer {
       int r = sd_bus_send(nullptr, reply, nullptr);
       sd_bus_message_unref(reply);
       return r;
+    }
+    if (sd_bus_message_is_method_call(call, nullptr, "PerformCommand") > 0 &&
+        sd_bus_message_skip(call, "s") >= 0) {
+      const char* command = nullptr;
+      if (sd_bus_message_read(call, "s", &command) > 0 && std::string_view(command) == "Flood") {
+        for (int i = 0; i < kFlood; ++i)
+          sd_bus_emit_signal(sd_bus_message_get_bus(call), "/org/halvex/Server",
+                             "org.halvex.Server1", "Event", "sv", "Noise", "x", std::int64_t{i});
+      }
     }
     return sd_bus_reply_method_errorf(call, SD_BUS_ERROR_SERVICE_UNKNOWN, "not me");
   }
@@ -242,6 +252,13 @@ TEST_F(ManagerTest, OnlyTheBusDriverSaysTheServerIsNotRunning) {
   ASSERT_TRUE(waitFor(1, kEventServerStateChange) && drain());
   EXPECT_EQ(states(), std::vector<std::string>{kServerStateStarted});
   EXPECT_EQ(mail("Noise").size(), 256u);
+  // Events the queue has not taken yet are capped; the rest are dropped, not held.
+  std::promise<void> release;
+  queue_->post([gate = release.get_future().share()] { gate.wait(); });
+  client::PerformCommand(manager_, "Flood", {}, reply);  // answered after its events
+  release.set_value();
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(mail("Noise").size(), 256u + 1024u);
 
   rogue.reset();
   bus_.stop();

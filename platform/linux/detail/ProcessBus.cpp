@@ -214,8 +214,9 @@ bool ProcessBus::borrow(const Task& send) {
       return false;
     }
     // The loop sleeps with the events it computed before: a message left queued needs it to
-    // wait for POLLOUT, and an earlier deadline needs its timer moved.
-    wakeLoop = rearmWanted_ || (bus_ != nullptr && (sd_bus_get_events(bus_) & POLLOUT) != 0);
+    // wait for POLLOUT, and an earlier deadline needs its timer moved. (A borrower never drops
+    // the connection: bus_ is still the one checked above.)
+    wakeLoop = rearmWanted_ || (sd_bus_get_events(bus_) & POLLOUT) != 0;
   }
   if (wakeLoop) {
     wake();

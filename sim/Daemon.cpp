@@ -84,14 +84,20 @@ int guarded(sd_bus_error* error, Body body) noexcept {
   }
 }
 
+// Answers a call with an error, saying so in the journal.
+int refuse(const Logger& journal, sd_bus_error* error, const std::string& asked, const char* name,
+           const char* text) {
+  journal.log(LogLevel::kInfo, asked + ": " + name);
+  return sd_bus_error_set(error, name, text);
+}
+
 // Reads the request dictionary that ends every Perform method; a value outside the message types
 // is the caller's mistake and answered as such.
 int readRequest(sd_bus_message* call, sd_bus_error* error, MessageDict& request,
                 const Logger& journal, const std::string& asked) {
   if (bus::readDict(call, request) < 0) {
-    journal.log(LogLevel::kInfo, asked + ": refused, a value outside the message types");
-    return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
-                            "the request holds a value outside the message types");
+    return refuse(journal, error, asked, SD_BUS_ERROR_INVALID_ARGS,
+                  "the request holds a value outside the message types");
   }
   return 0;
 }
@@ -218,8 +224,6 @@ struct Daemon::Impl {
   void respond(Endpoint& endpoint, sd_bus_message* call, const Answer& answer, Reply reply);
   void sendReply(const Endpoint& endpoint, sd_bus_message* call, const Reply& reply);
   int emitEvent(const char* name, const MessageValue& payload);
-  // Answers a control call with error name, and logs that.
-  int refuse(sd_bus_error* error, const std::string& asked, const char* name, const char* text);
   std::int64_t vendorSeenByTool() const {
     return scenario.device.present ? scenario.device.radioVendor : 0;
   }
@@ -630,12 +634,6 @@ int Daemon::Impl::emitEvent(const char* name, const MessageValue& payload) {
   return r;
 }
 
-int Daemon::Impl::refuse(sd_bus_error* error, const std::string& asked, const char* name,
-                         const char* text) {
-  control.journal.log(LogLevel::kInfo, asked + ": " + name);
-  return sd_bus_error_set(error, name, text);
-}
-
 int Daemon::Impl::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_error* error) {
   return guarded(error, [&] {
     auto* impl = static_cast<Impl*>(userdata);
@@ -818,9 +816,11 @@ int Daemon::Impl::onEmitState(sd_bus_message* call, void* userdata, sd_bus_error
     auto* impl = static_cast<Impl*>(userdata);
     const std::optional<StateEvent>& state = impl->scenario.server.state;
     if (!state)
-      return impl->refuse(error, "EmitState", kErrorNoState, "the scenario has no state event");
+      return refuse(impl->control.journal, error, "EmitState", kErrorNoState,
+                    "the scenario has no state event");
     if (impl->emitEvent(kEventServerStateChange, state->payload) < 0) {
-      return impl->refuse(error, "EmitState", kErrorServerAbsent, "the server is not on the bus");
+      return refuse(impl->control.journal, error, "EmitState", kErrorServerAbsent,
+                    "the server is not on the bus");
     }
     impl->control.journal.log(LogLevel::kInfo, "EmitState: sent " + describe(state->payload));
     return sd_bus_reply_method_return(call, "");
@@ -837,11 +837,12 @@ int Daemon::Impl::onEmitEvent(sd_bus_message* call, void* userdata, sd_bus_error
     const std::string asked = std::string("EmitEvent ") + name;
     MessageValue payload;
     if (bus::readVariant(call, payload) < 0) {
-      return impl->refuse(error, asked, SD_BUS_ERROR_INVALID_ARGS,
-                          "the payload holds a value outside the message types");
+      return refuse(impl->control.journal, error, asked, SD_BUS_ERROR_INVALID_ARGS,
+                    "the payload holds a value outside the message types");
     }
     if (impl->emitEvent(name, payload) < 0)
-      return impl->refuse(error, asked, kErrorServerAbsent, "the server is not on the bus");
+      return refuse(impl->control.journal, error, asked, kErrorServerAbsent,
+                    "the server is not on the bus");
     impl->control.journal.log(LogLevel::kInfo, asked + ": sent " + describe(payload));
     return sd_bus_reply_method_return(call, "");
   });

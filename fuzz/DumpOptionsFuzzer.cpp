@@ -15,13 +15,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   using namespace halvex;
   using halvex::fuzz::check;
   const std::string text(reinterpret_cast<const char*>(data), size);
-  std::vector<std::string> words;
-  std::size_t start = 0;
-  while (start < text.size()) {
-    const std::size_t end = std::min(text.find('\n', start), text.size());
-    words.push_back(text.substr(start, end - start));
-    start = end + 1;
-  }
+  std::vector<std::string> words = halvex::fuzz::split(text, '\n');
 
   bool wantCompress = true;
   bool wantNonui = false;

@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace halvex::fuzz {
 
@@ -35,6 +36,19 @@ inline void check(bool holds, const char* property, const Detail& detail) {
   if (!holds) {
     fail(property, detail());
   }
+}
+
+// The pieces of text between separators, as getline would read them: a trailing separator ends
+// the last piece rather than starting an empty one.
+inline std::vector<std::string> split(const std::string& text, char separator) {
+  std::vector<std::string> parts;
+  std::size_t start = 0;
+  while (start < text.size()) {
+    const std::size_t end = std::min(text.find(separator, start), text.size());
+    parts.push_back(text.substr(start, end - start));
+    start = end + 1;
+  }
+  return parts;
 }
 
 // Reads the input front to back. Past the end every read yields zeros, so that any input, the

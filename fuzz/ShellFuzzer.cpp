@@ -139,17 +139,6 @@ void install(const Scene& scene) {
   platform.clearRequests();
 }
 
-std::vector<std::string> split(const std::string& text, char separator) {
-  std::vector<std::string> parts;
-  std::size_t start = 0;
-  while (start < text.size()) {
-    const std::size_t end = std::min(text.find(separator, start), text.size());
-    parts.push_back(text.substr(start, end - start));
-    start = end + 1;
-  }
-  return parts;
-}
-
 // Removes the prompts from out and returns how many there were.
 std::size_t takePrompts(std::string& out) {
   std::size_t count = 0;

@@ -42,25 +42,19 @@ MessageDict fetchIdentity() {
     return *kept;
   }
   MessageDict identity;
-  const auto ask = [&identity] {
-    return bus::ProcessBus::instance().call(
-        {bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, "GetIdentity",
-         bus::callBounds().identity, "device", "GetIdentity"},
-        nullptr, [&identity](sd_bus_message* reply) {
-          if (sd_bus_message_has_signature(reply, "a{sv}") <= 0 ||
-              bus::readDict(reply, identity) < 0) {
-            identity = {};
-            return bus::makeResult(kResultBadReply, "identity of the wrong shape");
-          }
-          return Result{};
-        });
-  };
-  Result result = ask();
-  // A connection that went stale while nobody served it (the bus restarted before the run loop
-  // started) only shows when used; the question is harmless to ask again on a fresh one.
-  if (result.code == kResultConnectionLost) {
-    result = ask();
-  }
+  // A connection that went stale while nobody served it is replaced by the bus itself when the
+  // question cannot be sent on it.
+  const Result result = bus::ProcessBus::instance().call(
+      {bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, "GetIdentity",
+       bus::callBounds().identity, "device", "GetIdentity"},
+      nullptr, [&identity](sd_bus_message* reply) {
+        if (sd_bus_message_has_signature(reply, "a{sv}") <= 0 ||
+            bus::readDict(reply, identity) < 0) {
+          identity = {};
+          return bus::makeResult(kResultBadReply, "identity of the wrong shape");
+        }
+        return Result{};
+      });
   if (result.ok()) {
     kept = identity;
   }

@@ -83,6 +83,11 @@ bool CommandBase::canExecute(const std::string& /*word*/) {
 
 void CommandBase::addOption(const std::string& optionName, OptionHandler handler,
                             const std::string& description) {
+  addOption(optionName, std::move(handler), description, {});
+}
+
+void CommandBase::addOption(const std::string& optionName, OptionHandler handler,
+                            const std::string& description, std::vector<std::string> words) {
   if (!handler) {
     return;
   }
@@ -90,6 +95,14 @@ void CommandBase::addOption(const std::string& optionName, OptionHandler handler
   if (!description.empty()) {
     optionHelp_[optionName] = description;
   }
+  if (!words.empty()) {
+    optionWords_[optionName] = std::move(words);
+  }
+}
+
+std::vector<std::string> CommandBase::getOptionWords(const std::string& optionName) const {
+  const auto found = optionWords_.find(optionName);
+  return found != optionWords_.end() ? found->second : std::vector<std::string>();
 }
 
 void CommandBase::addSubCommand(const std::string& commandName,

@@ -66,6 +66,11 @@ class CommandBase : public std::enable_shared_from_this<CommandBase> {
   void addOption(const std::string& optionName, OptionHandler handler,
                  const std::string& description);
 
+  // As above, and declares the words the option takes before any word of the user's own (flags
+  // such as "nocompress"); completion offers them. An empty list keeps what was declared before.
+  void addOption(const std::string& optionName, OptionHandler handler,
+                 const std::string& description, std::vector<std::string> words);
+
   // Registers command as the child commandName, replacing an earlier one. Neither its name nor
   // its parent is checked. A null command is ignored: the shell could not enter it.
   void addSubCommand(const std::string& commandName, std::shared_ptr<CommandBase> command);
@@ -75,6 +80,8 @@ class CommandBase : public std::enable_shared_from_this<CommandBase> {
   void addSubCommand(const std::vector<std::string>& names, std::shared_ptr<CommandBase> command);
 
   bool hasOption(const std::string& optionName) const;
+  // The words the option declared; empty when it declared none or is not registered.
+  std::vector<std::string> getOptionWords(const std::string& optionName) const;
   // Names and aliases both count.
   bool hasSubCommand(const std::string& commandName) const;
   // The child registered under commandName or that alias, else null. Never adds an entry.
@@ -106,6 +113,7 @@ class CommandBase : public std::enable_shared_from_this<CommandBase> {
   std::string path_;
   OptionTable options_;
   DescriptionTable optionHelp_;
+  std::map<std::string, std::vector<std::string>> optionWords_;
   SubCommandTable subCommands_;
   SubCommandTable subCommandAliases_;
 };

@@ -6,20 +6,13 @@
 #include <ostream>
 #include <utility>
 
+#include "shell/Completion.h"
 #include "shell/Console.h"
+#include "shell/editor/LineEditor.h"
 
 namespace halvex {
 
-namespace {
-
-// Exactly what formatted extraction skips in the classic locale; deliberately not isspace(),
-// whose answer for bytes above 0x7F depends on the C locale.
-bool isWordSeparator(char c) {
-  return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
-}
-
-}  // namespace
-
+CommandShell::CommandShell() = default;
 CommandShell::~CommandShell() = default;
 
 bool CommandShell::run(std::vector<std::string> args) {
@@ -33,13 +26,16 @@ bool CommandShell::run(std::vector<std::string> args) {
   }
   if (args.empty()) {
     workingCommand_ = rootCommand_;
+    if (editor::Terminal* terminal = consoleTerminal()) {
+      editor_ = std::make_unique<editor::LineEditor>(*terminal, [this](std::string_view before) {
+        return completeWord(workingCommand_, before);
+      });
+    }
   }
 
   std::vector<std::vector<std::string>> batch = splitCommands(std::move(args));
   // Once any command of the run has failed, every later batch runs only its first command.
   bool runOk = true;
-  std::istream& in = consoleIn();
-  std::ostream& out = consoleOut();
   std::string line;
   for (;;) {
     bool commandOk = true;
@@ -58,9 +54,7 @@ bool CommandShell::run(std::vector<std::string> args) {
     }
 
     currentCommand_ = workingCommand_;
-    out << '(' << workingCommand_->getPath() << ")>> " << std::flush;
-    // A last line without a newline still counts; only a read that gets nothing ends the run.
-    if (!std::getline(in, line)) {
+    if (!readLine('(' + workingCommand_->getPath() + ")>> ", line)) {
       return false;
     }
     batch = splitCommands(splitWords(line));
@@ -126,11 +120,26 @@ CommandShell::Outcome CommandShell::evaluate(const std::vector<std::string>& wor
   return Outcome::kEnded;
 }
 
+bool CommandShell::readLine(const std::string& prompt, std::string& line) {
+  if (editor_) {
+    consoleOut().flush();
+    std::optional<std::string> edited = editor_->readLine(prompt);
+    if (!edited) {
+      return false;
+    }
+    line = std::move(*edited);
+    return true;
+  }
+  writeText(consoleOut(), prompt);
+  // A last line without a newline still counts; only a read that gets nothing ends the run.
+  return static_cast<bool>(std::getline(consoleIn(), line));
+}
+
 void CommandShell::reportInvalid(const std::string& word) {
   std::ostream& out = consoleOut();
-  out << '\n' << std::flush;
+  writeText(out, "\n");
   // No newline: the help listing that follows starts with its own.
-  out << "Invalid command option '\x1b[31m" << word << "\x1b[39m'" << std::flush;
+  writeText(out, "Invalid command option '\x1b[31m" + word + "\x1b[39m'");
   currentCommand_->printHelp();
 }
 

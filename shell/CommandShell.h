@@ -22,9 +22,13 @@
 
 namespace halvex {
 
+namespace editor {
+class LineEditor;
+}
+
 class CommandShell {
  public:
-  CommandShell() = default;
+  CommandShell();
   virtual ~CommandShell();
 
   CommandShell(const CommandShell&) = delete;
@@ -39,6 +43,12 @@ class CommandShell {
   // Words of line, separated by runs of space, \t, \n, \v, \f and \r. Every other byte, NUL and
   // bytes above 0x7F included, belongs to a word; there is no quoting.
   static std::vector<std::string> splitWords(const std::string& line);
+
+  // Space, \t, \n, \v, \f and \r: exactly what formatted extraction skips in the classic locale
+  // (deliberately not isspace(), whose answer for bytes above 0x7F depends on the C locale).
+  static bool isWordSeparator(char c) {
+    return c == ' ' || c == '\t' || c == '\n' || c == '\v' || c == '\f' || c == '\r';
+  }
 
   // Groups words into commands at each "--", which is dropped; empty commands are dropped too.
   static std::vector<std::vector<std::string>> splitCommands(std::vector<std::string> words);
@@ -65,6 +75,8 @@ class CommandShell {
   // Evaluates one command's words; commandOk records whether it succeeded.
   Outcome evaluate(const std::vector<std::string>& words, bool& commandOk);
   void reportInvalid(const std::string& word);
+  // Shows the prompt and reads the next line; false when input has ended.
+  bool readLine(const std::string& prompt, std::string& line);
 
   std::shared_ptr<CommandBase> rootCommand_;
   // What the prompt shows and every interactive command starts from. Null in one-shot mode,
@@ -72,6 +84,9 @@ class CommandShell {
   std::shared_ptr<CommandBase> workingCommand_;
   // What the words of the command being evaluated are resolved against.
   std::shared_ptr<CommandBase> currentCommand_;
+  // Edits the interactive lines when the console is a terminal; null when it is not, and then
+  // the lines are read exactly as they come.
+  std::unique_ptr<editor::LineEditor> editor_;
 };
 
 }  // namespace halvex

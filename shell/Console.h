@@ -7,21 +7,44 @@
 #pragma once
 
 #include <iosfwd>
+#include <optional>
+#include <string>
 #include <string_view>
 
 namespace halvex {
+
+namespace editor {
+class Terminal;
+}
 
 std::istream& consoleIn();
 std::ostream& consoleOut();
 std::ostream& consoleErr();
 
+// The terminal behind consoleIn() and consoleOut(), for the line editor: the process's own when
+// its standard input and output are both terminals and no ScopedConsoleForTesting is alive, the
+// one a ScopedConsoleForTesting names, or else null. Shell thread only.
+editor::Terminal* consoleTerminal();
+
+// Call first thing in main. A standard descriptor the process was started without is opened on
+// /dev/null, so that no file or socket opened later takes its number and receives what is meant
+// for the console; output that went to a closed standard output still counts as lost.
+void reserveStandardDescriptors();
+
+// Flushes consoleOut() and says why some of what was written to it was lost (a full device, a
+// closed or broken output), or nothing when all of it arrived. Call it once output is over.
+std::optional<std::string> consoleOutError();
+
 // Writes text, a newline, and flushes: every line the tool prints ends this way, so that a line
 // is complete on the terminal (or in a pipe) before the next prompt or a later line from another
-// thread.
+// thread. Text that cannot be written is noted for consoleOutError().
 void writeLine(std::ostream& out, std::string_view text);
+// The same without the newline, for a prompt or the start of a line.
+void writeText(std::ostream& out, std::string_view text);
 
-// Test-only: redirects the console to the given streams for this object's lifetime, and restores
-// what was there before on destruction (scopes may nest). The streams must outlive this object.
+// Test-only: redirects the console to the given streams (and terminal, if any) for this object's
+// lifetime, and restores what was there before on destruction (scopes may nest). The streams
+// and the terminal must outlive this object.
 //
 // Threads: construct it before any other thread may use the console and destroy it only after
 // they have stopped using it; swapping streams under a thread that is writing is not supported.
@@ -29,7 +52,8 @@ void writeLine(std::ostream& out, std::string_view text);
 // (the shell guarantees that by waiting for each option's work before it prints again).
 class ScopedConsoleForTesting {
  public:
-  ScopedConsoleForTesting(std::istream& in, std::ostream& out, std::ostream& err);
+  ScopedConsoleForTesting(std::istream& in, std::ostream& out, std::ostream& err,
+                          editor::Terminal* terminal = nullptr);
   ~ScopedConsoleForTesting();
 
   ScopedConsoleForTesting(const ScopedConsoleForTesting&) = delete;
@@ -39,6 +63,8 @@ class ScopedConsoleForTesting {
   std::istream* previousIn_;
   std::ostream* previousOut_;
   std::ostream* previousErr_;
+  editor::Terminal* previousTerminal_;
+  bool previousScoped_;
 };
 
 }  // namespace halvex

@@ -9,6 +9,8 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <optional>
+#include <string>
 #include <utility>
 
 #include "Tools/HalvexTool/HalvexCommand.h"
@@ -87,6 +89,7 @@ bool runStartupChecks() {
 }
 
 int halvexMain(std::vector<std::string>& arguments) {
+  reserveStandardDescriptors();
   if (!runStartupChecks()) {
     return -1;
   }
@@ -106,6 +109,11 @@ void* shellThreadMain(void* arguments) {
   // Never destroyed: exit() ends the process with the shell, its tree and its session alive.
   auto shell = std::make_shared<HalvexShell>();
   const bool ok = shell->run(std::move(list));
+  // As the standard tools do: output that was lost makes the run a failure, and says why.
+  if (std::optional<std::string> lost = consoleOutError()) {
+    writeLine(consoleErr(), device::getProgramName() + ": " + *lost);
+    std::exit(1);
+  }
   std::exit(ok ? 0 : 1);
 }
 

@@ -59,12 +59,14 @@ bool LogdumpCommand::canExecute(const std::string& name) {
 
 void LogdumpCommand::registerCommands() {
   std::weak_ptr<CommandBase> self = weak_from_this();
+  // The words each collection takes before its reason, for completion at a terminal.
   addOption("tel", bindCollection(self, collectTelephonyLogs),
-            "[nocompress] [nonui] <reason> collect telephony logs");
+            "[nocompress] [nonui] <reason> collect telephony logs", {"nocompress", "nonui"});
   addOption("core", bindCollection(self, collectTelephonyLogsWithCoredump),
-            "[nocompress] [nonui] <reason> collect telephony logs with coredump");
+            "[nocompress] [nonui] <reason> collect telephony logs with coredump",
+            {"nocompress", "nonui"});
   addOption("bb", bindCollection(self, collectBasebandLogs),
-            "[nocompress] <reason> collect baseband logs only");
+            "[nocompress] <reason> collect baseband logs only", {"nocompress"});
 }
 
 }  // namespace halvex

@@ -38,7 +38,8 @@ class TestCommand : public CommandBase {
   }
 
   // An option that prints "name(arg,arg)" and fails when its first argument is "fail".
-  void addEcho(const std::string& name, const std::string& description = "") {
+  void addEcho(const std::string& name, const std::string& description = "",
+               std::vector<std::string> words = {}) {
     addOption(
         name,
         [name](TaskGroup, std::vector<std::string> args) {
@@ -49,7 +50,7 @@ class TestCommand : public CommandBase {
           writeLine(consoleOut(), line + ")");
           return args.empty() || args.front() != "fail";
         },
-        description);
+        description, std::move(words));
   }
 
   bool canExecute(const std::string& word) override {
@@ -76,9 +77,11 @@ class TestCommand : public CommandBase {
 inline std::shared_ptr<TestCommand> makeToolTree() {
   return TestCommand::create("halvextool", {}, [](TestCommand& root) {
     root.addChild("logdump", [](TestCommand& logdump) {
-      logdump.addEcho("tel", "[nocompress] [nonui] <reason> collect telephony logs");
-      logdump.addEcho("core", "[nocompress] [nonui] <reason> collect telephony logs with coredump");
-      logdump.addEcho("bb", "[nocompress] <reason> collect baseband logs only");
+      logdump.addEcho("tel", "[nocompress] [nonui] <reason> collect telephony logs",
+                      {"nocompress", "nonui"});
+      logdump.addEcho("core", "[nocompress] [nonui] <reason> collect telephony logs with coredump",
+                      {"nocompress", "nonui"});
+      logdump.addEcho("bb", "[nocompress] <reason> collect baseband logs only", {"nocompress"});
     });
   });
 }

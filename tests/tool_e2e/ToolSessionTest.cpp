@@ -2,11 +2,15 @@
 // The real halvextool against halvex-sim on a private bus, each run compared whole: exit status,
 // both output streams and the requests the simulated device received.
 #include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <termios.h>
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 #include <vector>
 
+#include "tests/support/Pty.h"
 #include "tests/support/TestBus.h"
 
 namespace halvex::e2e {
@@ -127,6 +131,71 @@ TEST(ToolSession, InteractiveRuns) {
              exempt(R"({"commands": {"TraceDumpState": {"fault": "exit"}}})"), {},
              "logdump tel\nquit\n", "exit 0", kPrompt + kTel + "Failed\n" + kPrompt, "",
              {kModeQuery, kTelDump});
+}
+
+TEST(ToolSession, OutputThatCannotBeWrittenFailsTheRun) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, stamped("T"));
+  for (const auto& [redirection, reason] :
+       {std::pair{">/dev/full", "No space left on device"}, {">&-", "Bad file descriptor"}}) {
+    SCOPED_TRACE(redirection);
+    const test::RunResult run = test::runProcess(
+        {.args = {"/bin/sh", "-c", std::string("exec \"$0\" logdump tel ") + redirection,
+                  HALVEXTOOL_BINARY},
+         .env = {},
+         .input = ""});
+    EXPECT_EQ(run.status.describe(), "exit 1");
+    EXPECT_EQ(run.err, std::string("halvextool: write error: ") + reason + "\n");
+  }
+}
+
+auto terminalModes(int fd) {
+  termios t{};
+  EXPECT_EQ(::tcgetattr(fd, &t), 0);
+  return std::make_tuple(t.c_iflag, t.c_oflag, t.c_cflag, t.c_lflag,
+                         std::vector<cc_t>(std::begin(t.c_cc), std::end(t.c_cc)));
+}
+
+// What a user at a terminal does: complete, run, recall, edit, run again, leave with Ctrl-D.
+TEST(ToolTerminal, EditsLinesAndLeavesTheTerminalAsItWas) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, stamped("T"));
+  const test::Pty pty(100);
+  const auto before = terminalModes(pty.slave);
+  const pid_t tool =
+      test::spawnChild({HALVEXTOOL_BINARY}, {}, {{pty.slave, 0}, {pty.slave, 1}, {pty.slave, 2}});
+  pty.readUntil(kPrompt);
+  pty.type("lo\tt\tab\r");
+  EXPECT_NE(pty.readUntil(kTel + "Success").find(kPrompt + "logdump tel ab\x1b[K"),
+            std::string::npos);
+  pty.readUntil(kPrompt);
+  pty.type("\x1b[A\x1b[D\x7f\r");
+  EXPECT_NE(pty.readUntil(kTel + "Success").find(kPrompt + "logdump tel b\x1b[K"),
+            std::string::npos);
+  pty.readUntil(kPrompt);
+  pty.type("\x04");
+  EXPECT_EQ(test::waitChild(tool, std::chrono::seconds(10)).describe(), "exit 1");
+  EXPECT_EQ(terminalModes(pty.slave), before);
+  const std::vector<std::string> requests = commandRequests(sim);
+  ASSERT_EQ(requests.size(), 4u);
+  EXPECT_NE(requests[1].find("Reason='[halvextool] ab'"), std::string::npos);
+  EXPECT_NE(requests[3].find("Reason='[halvextool] b'"), std::string::npos);
+}
+
+// With only its input on a terminal, the tool reads and prints exactly as it does from a pipe.
+TEST(ToolTerminal, OutputElsewhereGetsThePlainShell) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, stamped("T"));
+  const test::Pty pty(80);
+  const int out = ::memfd_create("out", 0);
+  const pid_t tool = test::spawnChild({HALVEXTOOL_BINARY}, {}, {{pty.slave, 0}, {out, 1}});
+  pty.type("logdump tel\rquit\r");
+  EXPECT_EQ(test::waitChild(tool, std::chrono::seconds(10)).describe(), "exit 0");
+  std::string printed(4096, '\0');
+  printed.resize(static_cast<std::size_t>(
+      std::max<ssize_t>(::pread(out, printed.data(), printed.size(), 0), 0)));
+  ::close(out);
+  EXPECT_EQ(printed, kPrompt + kTel + "Success\n" + kPath + "T.tar.gz\n" + kPrompt);
 }
 
 // The simulator keeps processes with the names it is given alive while it runs.

@@ -57,10 +57,12 @@ class LineEditor {
 
  private:
   enum class Step : unsigned char { kGoOn, kAccept, kEnd };
+  // Ctrl-R's state. No default member initialisers: clang needs them before LineEditor is
+  // complete for std::optional<Search>; emplace() value-initialises instead.
   struct Search {
     std::string query;
     std::optional<History::Match> match;
-    bool failed = false;
+    bool failed;
   };
 
   Step handle(const KeyEvent& event);

@@ -2,10 +2,10 @@
 // The line editor driven through an in-memory terminal: keys in, lines and screen bytes out.
 #include <gtest/gtest.h>
 
-#include <deque>
 #include <string>
 #include <vector>
 
+#include "FakeTerminal.h"
 #include "TestTree.h"
 #include "shell/Completion.h"
 #include "shell/editor/History.h"
@@ -19,64 +19,13 @@ using namespace std::string_literals;
 
 const std::string kMark = "\x1b[7m?\x1b[27m";  // how an unprintable byte shows
 
-// Hands out one read per call, in the pieces given; a "" is a pause longer than a key takes.
-class FakeTerminal : public Terminal {
- public:
-  FakeTerminal(std::vector<std::string> reads, int width) : reads_(reads.begin(), reads.end()) {
-    columns_ = width;
-  }
-
-  bool enterRaw() override {
-    raw = refuseRaw ? raw : true;
-    return !refuseRaw;
-  }
-  void leaveRaw() override { raw = false; }
-  int columns() override { return columns_; }
-  long read(char* buffer, std::size_t size) override {
-    while (!reads_.empty() && reads_.front().empty()) {
-      reads_.pop_front();
-    }
-    if (reads_.empty()) {
-      return 0;
-    }
-    std::string& next = reads_.front();
-    const std::size_t n = std::min(size, next.size());
-    next.copy(buffer, n);
-    next.erase(0, n);
-    if (next.empty()) {
-      reads_.pop_front();
-    }
-    return static_cast<long>(n);
-  }
-  bool waitForInput(std::chrono::milliseconds) override {
-    if (!reads_.empty() && reads_.front().empty()) {
-      reads_.pop_front();
-      return false;
-    }
-    return !reads_.empty();
-  }
-  void write(std::string_view bytes) override {
-    EXPECT_TRUE(raw || refuseRaw) << "drawn outside raw mode";
-    screen.append(bytes);
-  }
-  void suspend() override { screen += "<suspended>"; }
-
-  bool raw = false;
-  bool refuseRaw = false;
-  std::string screen;
-
- private:
-  std::deque<std::string> reads_;
-  int columns_;
-};
-
 struct Session {
   std::vector<std::string> lines;  // every line read until input ended
   std::string screen;
 };
 
-Session edit(std::vector<std::string> reads, int width = 80, bool refuseRaw = false) {
-  FakeTerminal terminal(std::move(reads), width);
+Session edit(const std::vector<std::string>& reads, int width = 80, bool refuseRaw = false) {
+  testing::FakeTerminal terminal(reads, width);
   terminal.refuseRaw = refuseRaw;
   const auto root = testing::makeToolTree();
   LineEditor editor(terminal, [&](std::string_view before) { return completeWord(root, before); });
@@ -86,6 +35,7 @@ Session edit(std::vector<std::string> reads, int width = 80, bool refuseRaw = fa
     session.lines.push_back(std::move(*line));
   }
   EXPECT_FALSE(terminal.raw);
+  EXPECT_FALSE(terminal.drewOutsideRaw);
   session.screen = std::move(terminal.screen);
   return session;
 }

@@ -24,7 +24,7 @@ class Daemon {
   // Connects to the system bus and starts the scenario's processes. Throws std::runtime_error.
   // Once every name present at start is owned, tells the service manager (READY=1, when
   // NOTIFY_SOCKET is set) and then options.readyFd.
-  Daemon(Scenario scenario, DaemonOptions options);
+  Daemon(const Scenario& scenario, DaemonOptions options);
   ~Daemon();
   Daemon(const Daemon&) = delete;
   Daemon& operator=(const Daemon&) = delete;

@@ -7,12 +7,12 @@
 #include <cstdint>
 #include <map>
 #include <optional>
-#include <stdexcept>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "platform/MessageDict.h"
+#include "sim/ScenarioError.h"
 
 namespace halvex::sim {
 
@@ -95,18 +95,6 @@ struct Scenario {
   std::vector<std::string> processes;
   Server server;
   Helper helper;
-};
-
-// A problem in a scenario: where (a JSON pointer, "" for the whole document) and what.
-class ScenarioError : public std::runtime_error {
- public:
-  ScenarioError(std::string pointer, std::string problem);
-  const std::string& pointer() const { return pointer_; }
-  const std::string& problem() const { return problem_; }
-
- private:
-  std::string pointer_;
-  std::string problem_;
 };
 
 // Every default: a working device whose server has started and whose baseband logs are enabled.

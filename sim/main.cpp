@@ -148,7 +148,7 @@ int main(int argc, char** argv) {
   // A reader of the ready pipe or of a reply may go away; that must not end the simulator.
   ::signal(SIGPIPE, SIG_IGN);
   try {
-    halvex::sim::Daemon daemon(std::move(scenario), std::move(options));
+    halvex::sim::Daemon daemon(scenario, std::move(options));
     return daemon.run();
   } catch (const std::exception& e) {
     std::fprintf(stderr, "halvex-sim: %s\n", e.what());

@@ -1,0 +1,32 @@
+// SPDX-License-Identifier: MIT
+// The device identity service, org.halvex.Device1 at /org/halvex/Device: GetIdentity answers with
+// the identity the object holds, which starts as the scenario's. Runs on the daemon's loop.
+#pragma once
+
+#include <cstdint>
+
+#include "sim/Endpoint.h"
+#include "sim/Scenario.h"
+
+namespace halvex::sim {
+
+class DeviceObject {
+ public:
+  DeviceObject(Device identity, const Services& services);
+  DeviceObject(const DeviceObject&) = delete;
+  DeviceObject& operator=(const DeviceObject&) = delete;
+
+  Endpoint& endpoint() { return endpoint_; }
+  // The radio vendor the tool reads: 0 when the device identity service is absent.
+  std::int64_t vendorSeenByTool() const { return identity_.present ? identity_.radioVendor : 0; }
+
+ private:
+  static int onGetIdentity(sd_bus_message* call, void* userdata, sd_bus_error* error);
+  static const sd_bus_vtable kVtable[];
+
+  Device identity_;
+  const Services& services_;
+  Endpoint endpoint_;
+};
+
+}  // namespace halvex::sim

@@ -148,18 +148,25 @@ bool CommandShell::changeCommand(const std::vector<std::string>& words) {
     return false;
   }
   for (const std::string& component : splitPath(words.front(), '/')) {
-    if (currentCommand_->hasSubCommand(component)) {
-      currentCommand_ = currentCommand_->getSubCommand(component);
-    } else if (component == "..") {
-      if (std::shared_ptr<CommandBase> parent = currentCommand_->getParent().lock()) {
-        currentCommand_ = std::move(parent);
-      }
-    } else {
+    if (!stepPath(currentCommand_, component)) {
       return false;
     }
   }
   if (workingCommand_) {
     workingCommand_ = currentCommand_;
+  }
+  return true;
+}
+
+bool CommandShell::stepPath(std::shared_ptr<CommandBase>& command, const std::string& component) {
+  if (command->hasSubCommand(component)) {
+    command = command->getSubCommand(component);
+  } else if (component == "..") {
+    if (std::shared_ptr<CommandBase> parent = command->getParent().lock()) {
+      command = std::move(parent);
+    }
+  } else {
+    return false;
   }
   return true;
 }

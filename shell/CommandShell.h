@@ -53,6 +53,10 @@ class CommandShell {
   // Groups words into commands at each "--", which is dropped; empty commands are dropped too.
   static std::vector<std::vector<std::string>> splitCommands(std::vector<std::string> words);
 
+  // One component of a "cd" path from command: a sub-command (names and aliases) or "..", the
+  // parent, which at the root stays put. False, with command unchanged, for anything else.
+  static bool stepPath(std::shared_ptr<CommandBase>& command, const std::string& component);
+
   // Components of text between separators; empty components vanish. As the separators become
   // whitespace before splitting, whitespace inside text also splits components.
   static std::vector<std::string> splitPath(const std::string& text, char separator);

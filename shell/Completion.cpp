@@ -26,13 +26,7 @@ Completion completePath(std::shared_ptr<CommandBase> command, std::size_t start,
   const std::size_t componentStart = slash == std::string_view::npos ? 0 : slash + 1;
   for (const std::string& component :
        CommandShell::splitPath(std::string(typed.substr(0, componentStart)), '/')) {
-    if (command->hasSubCommand(component)) {
-      command = command->getSubCommand(component);
-    } else if (component == "..") {
-      if (std::shared_ptr<CommandBase> parent = command->getParent().lock()) {
-        command = std::move(parent);
-      }
-    } else {
+    if (!CommandShell::stepPath(command, component)) {
       return {};
     }
   }

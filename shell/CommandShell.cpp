@@ -122,7 +122,6 @@ CommandShell::Outcome CommandShell::evaluate(const std::vector<std::string>& wor
 
 bool CommandShell::readLine(const std::string& prompt, std::string& line) {
   if (editor_) {
-    consoleOut().flush();
     std::optional<std::string> edited = editor_->readLine(prompt);
     if (!edited) {
       return false;

@@ -36,6 +36,15 @@ void noteLoss(const std::ostream& out) {
   }
 }
 
+void write(std::ostream& out, std::string_view text, bool newline) {
+  out << text;
+  if (newline) {
+    out << '\n';
+  }
+  out << std::flush;
+  noteLoss(out);
+}
+
 }  // namespace
 
 std::istream& consoleIn() {
@@ -90,13 +99,11 @@ std::optional<std::string> consoleOutError() {
 }
 
 void writeText(std::ostream& out, std::string_view text) {
-  out << text << std::flush;
-  noteLoss(out);
+  write(out, text, false);
 }
 
 void writeLine(std::ostream& out, std::string_view text) {
-  out << text << '\n' << std::flush;
-  noteLoss(out);
+  write(out, text, true);
 }
 
 ScopedConsoleForTesting::ScopedConsoleForTesting(std::istream& in, std::ostream& out,

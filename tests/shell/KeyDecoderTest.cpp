@@ -138,10 +138,14 @@ TEST(KeyDecoderTest, PausesEndSequencesButNotPastes) {
     EXPECT_EQ(decode(c.pieces), c.keys);
   }
   KeyDecoder decoder;
-  decoder.feed("\x1b");
-  drain(decoder);
-  EXPECT_TRUE(decoder.waitingForMore());
-  decoder.feed("[200~line\r");
+  for (const char* unfinished : {"\x1b", "\xc3", "\xf0\x9f\x98"}) {
+    decoder.feed(unfinished);
+    EXPECT_TRUE(drain(decoder).empty());
+    EXPECT_TRUE(decoder.waitingForMore()) << unfinished;
+    decoder.expire();
+    drain(decoder);
+  }
+  decoder.feed("\x1b[200~line\r");
   drain(decoder);
   EXPECT_TRUE(decoder.inPaste());
   EXPECT_FALSE(decoder.waitingForMore());

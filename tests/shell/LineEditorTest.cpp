@@ -202,6 +202,7 @@ TEST(ScreenTest, DrawsTheVisiblePartAroundTheCursor) {
       {"", "\xe6\x97\xa5\xe6\x9c\xac\xe8\xaa\x9e", 9, 6,
        "\r\xe6\x9c\xac\xe8\xaa\x9e\x1b[K\r\x1b[4C"},
       {"", "a\x01\xff", 3, 80, "\ra" + kMark + kMark + "\x1b[K\r\x1b[3C"},
+      {"", "\xef\xbc\xa1x", 4, 80, "\r\xef\xbc\xa1x\x1b[K\r\x1b[3C"},
       {"0123456789abcdef>> ", "x", 1, 20, "\rabcdef>> x\x1b[K\r\x1b[10C"},
   };
   for (const auto& c : cases) {

@@ -136,14 +136,18 @@ TEST(ToolSession, InteractiveRuns) {
 TEST(ToolSession, OutputThatCannotBeWrittenFailsTheRun) {
   test::PrivateBus bus;
   test::SimProcess sim(bus, stamped("T"));
-  for (const auto& [redirection, reason] :
-       {std::pair{">/dev/full", "No space left on device"}, {">&-", "Bad file descriptor"}}) {
-    SCOPED_TRACE(redirection);
+  const test::TempDir dir;
+  // The last runs into a file size limit after a few hundred bytes written well, mid-help.
+  const std::string limited = "trap '' XFSZ; ulimit -f 1; exec \"$0\" >" +
+                              (dir.path() / "out").string() + " <<EOF\n" + std::string(40, 'x') +
+                              "\n" + std::string(20, 'x') + "\nEOF";
+  for (const auto& [shell, reason] :
+       {std::pair{std::string("exec \"$0\" logdump tel >/dev/full"), "No space left on device"},
+        {"exec \"$0\" logdump tel >&-", "Bad file descriptor"},
+        {limited, "File too large"}}) {
+    SCOPED_TRACE(shell);
     const test::RunResult run = test::runProcess(
-        {.args = {"/bin/sh", "-c", std::string("exec \"$0\" logdump tel ") + redirection,
-                  HALVEXTOOL_BINARY},
-         .env = {},
-         .input = ""});
+        {.args = {"/bin/sh", "-c", shell, HALVEXTOOL_BINARY}, .env = {}, .input = ""});
     EXPECT_EQ(run.status.describe(), "exit 1");
     EXPECT_EQ(run.err, std::string("halvextool: write error: ") + reason + "\n");
   }

@@ -115,6 +115,7 @@ TEST(LineEditorTest, HistoryAndSearchRecallLines) {
        {"one", "two", "one"},
        "(failed reverse-i-search)`oa': two"},
       {{"one\rX\x12on\x07\r"}, {"one", "X"}},
+      {{"one\rX\x12on\x03\r"}, {"one", ""}},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.reads.front());
@@ -202,7 +203,8 @@ TEST(ScreenTest, DrawsTheVisiblePartAroundTheCursor) {
       {"", "\xe6\x97\xa5\xe6\x9c\xac\xe8\xaa\x9e", 9, 6,
        "\r\xe6\x9c\xac\xe8\xaa\x9e\x1b[K\r\x1b[4C"},
       {"", "a\x01\xff", 3, 80, "\ra" + kMark + kMark + "\x1b[K\r\x1b[3C"},
-      {"", "\xef\xbc\xa1x", 4, 80, "\r\xef\xbc\xa1x\x1b[K\r\x1b[3C"},
+      {"", "\xef\xbc\xa1\xf0\x9f\x98\x80x", 8, 80,
+       "\r\xef\xbc\xa1\xf0\x9f\x98\x80x\x1b[K\r\x1b[5C"},
       {"0123456789abcdef>> ", "x", 1, 20, "\rabcdef>> x\x1b[K\r\x1b[10C"},
   };
   for (const auto& c : cases) {

@@ -12,6 +12,14 @@ halvex_pkg_config_dir(HALVEX_COMPLETIONS_DIR bash-completion completionsdir
                       ${CMAKE_INSTALL_DATADIR}/bash-completion/completions)
 halvex_pkg_config_dir(HALVEX_UNIT_DIR systemd systemd_system_unit_dir lib/systemd/system)
 halvex_pkg_config_dir(HALVEX_SYSUSERS_DIR systemd sysusers_dir lib/sysusers.d)
+# zsh has no pkg-config file: its completions go where zsh's own package looks for other
+# packages' (vendor-completions on Debian and Ubuntu, site-functions elsewhere).
+if(NOT HALVEX_ZSH_COMPLETIONS_DIR)
+  set(HALVEX_ZSH_COMPLETIONS_DIR ${CMAKE_INSTALL_DATADIR}/zsh/site-functions)
+  if(IS_DIRECTORY /usr/share/zsh/vendor-completions)
+    set(HALVEX_ZSH_COMPLETIONS_DIR ${CMAKE_INSTALL_DATADIR}/zsh/vendor-completions)
+  endif()
+endif()
 
 install(TARGETS halvextool halvex-sim RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT tool)
 halvex_strip_installed(tool OPTIONS --remove-section=.comment --remove-section=.note FILES
@@ -35,6 +43,8 @@ add_custom_target(halvex_man_pages ALL DEPENDS ${halvex_compressed_pages})
 
 install(FILES completion/halvextool completion/halvex-sim
   DESTINATION ${HALVEX_COMPLETIONS_DIR} COMPONENT tool)
+install(FILES completion/_halvextool completion/_halvex-sim
+  DESTINATION ${HALVEX_ZSH_COMPLETIONS_DIR} COMPONENT tool)
 
 install(FILES data/dbus/org.halvex.conf
   DESTINATION ${CMAKE_INSTALL_DATADIR}/dbus-1/system.d COMPONENT tool)

@@ -31,11 +31,14 @@ for library in "$@"; do
   # abidiff's status is a bit field: 1 an error, 2 a usage error, 4 an ABI change, 8 an
   # incompatible one.
   if ((code & 3)); then
-    printf 'check-abi: abidiff could not compare %s with %s:\n%s\n' "${library}" "${baseline}" "${report}" >&2
+    printf 'check-abi: abidiff could not compare %s with %s:\n%s\n' \
+      "${library}" "${baseline}" "${report}" >&2
     exit 2
   fi
-  printf 'check-abi: %s no longer offers the ABI of %s:\n%s\n' "${soname}" "${baseline##*/}" "${report}" >&2
-  printf 'An incompatible change needs a new SONAME (the major version in CMakeLists.txt) and a new baseline (bash scripts/check-abi.sh --write HEADERS LIBRARY...).\n' >&2
+  printf 'check-abi: %s no longer offers the ABI of %s:\n%s\n' \
+    "${soname}" "${baseline##*/}" "${report}" >&2
+  printf '%s\n' "An incompatible change needs a new SONAME (the major version in CMakeLists.txt)" \
+    "and a new baseline (bash scripts/check-abi.sh --write HEADERS LIBRARY...)." >&2
   status=1
 done
 exit "${status}"

@@ -1,4 +1,5 @@
 # SPDX-License-Identifier: MIT
+# shellcheck shell=bash
 # A throw-away bus for the scripts that source this file, on dbus-daemon or dbus-broker.
 #   start_private_bus CONFIG SOCKET [dbus-daemon|dbus-broker]
 #     starts a bus configured by CONFIG listening on the unix socket SOCKET (the configuration's

@@ -1,8 +1,8 @@
 # SPDX-License-Identifier: MIT
 # usage: zsh -f scripts/zsh-complete.zsh FOLDER LINE...
 # Types each LINE and a Tab into an interactive zsh whose completion functions come first from
-# FOLDER, and prints the candidates the completion offered: sorted, unique, space-separated, one
-# output line per LINE. compadd is wrapped to report every match it is given; the matches still
+# FOLDER, and prints for each LINE "LINE|CANDIDATES": the candidates the completion offered,
+# sorted, unique and space-separated. compadd is wrapped to report every match it is given; the matches still
 # go in, so that completion functions which look at what they added behave as they would.
 zmodload zsh/zpty || exit 2
 folder=$1
@@ -29,6 +29,7 @@ for line in "$@"; do
   zpty -w -n shell "${line}"$'\t'
   zpty -r shell out '*<end>*' || exit 4
   out=${out##*<begin>}
-  print -r -- ${(j: :)${(ou)${(M)${(s:</cand>:)out}:#*<cand>*}##*<cand>}}
+  offered=(${(ou)${(M)${(s:</cand>:)out}:#*<cand>*}##*<cand>})
+  print -r -- "${line}|${(j: :)offered}"
 done
 zpty -d shell

@@ -15,9 +15,14 @@ shift $(($# ? 1 : 0))
 
 version=$(dpkg-parsechangelog -l "${top}/debian/changelog" -S Version)
 released=$(dpkg-parsechangelog -l "${top}/debian/changelog" -S Timestamp)
+if [[ -d ${out} && ! -f ${out}/build.log && -n $(ls -A "${out}") ]]; then
+  echo "build-packages: ${out} holds something other than a package build; name another folder" >&2
+  exit 2
+fi
 rm -rf "${out}"
 mkdir -p "${out}"
 out=$(cd "${out}" && pwd)
+: >"${out}/build.log"
 copy="${out}/halvextool-${version}"
 mkdir "${copy}"
 

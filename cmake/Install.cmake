@@ -4,37 +4,36 @@
 #
 # Folders that other packages decide (bash completions, systemd units, sysusers.d) are read from
 # their pkg-config files and made relative to the prefix, so that a --prefix install stays inside
-# its prefix. The bus reads policies only from /usr/share/dbus-1/system.d and /etc/dbus-1/system.d:
-# the policy takes effect with the prefix /usr (and the packages), not /usr/local.
+# its prefix; a packager may set each instead (HALVEX_UNIT_DIR=/lib/systemd/system for Debian 12,
+# whose units live outside /usr). zsh has no pkg-config file: its completions go where zsh's own
+# package looks for other packages' (vendor-completions on Debian and Ubuntu, site-functions
+# elsewhere), or to HALVEX_ZSH_COMPLETIONS_DIR. The bus reads policies only from
+# /usr/share/dbus-1/system.d and /etc/dbus-1/system.d: the policy takes effect with the prefix
+# /usr (and the packages), not /usr/local.
 include(${CMAKE_CURRENT_LIST_DIR}/InstallHelpers.cmake)
 
 halvex_pkg_config_dir(HALVEX_COMPLETIONS_DIR bash-completion completionsdir
                       ${CMAKE_INSTALL_DATADIR}/bash-completion/completions)
 halvex_pkg_config_dir(HALVEX_UNIT_DIR systemd systemd_system_unit_dir lib/systemd/system)
 halvex_pkg_config_dir(HALVEX_SYSUSERS_DIR systemd sysusers_dir lib/sysusers.d)
+if(NOT HALVEX_ZSH_COMPLETIONS_DIR)
+  set(HALVEX_ZSH_COMPLETIONS_DIR ${CMAKE_INSTALL_DATADIR}/zsh/site-functions)
+  if(IS_DIRECTORY /usr/share/zsh/vendor-completions)
+    set(HALVEX_ZSH_COMPLETIONS_DIR ${CMAKE_INSTALL_DATADIR}/zsh/vendor-completions)
+  endif()
+endif()
 
 install(TARGETS halvextool halvex-sim RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT tool)
 halvex_strip_installed(tool OPTIONS --remove-section=.comment --remove-section=.note FILES
   ${CMAKE_INSTALL_BINDIR}/halvextool ${CMAKE_INSTALL_BINDIR}/halvex-sim)
 
-# Manual pages, compressed as Debian installs them.
-set(halvex_man_pages man/halvextool.1 man/halvex-sim.8)
-foreach(page IN LISTS halvex_man_pages)
-  get_filename_component(name ${page} NAME)
-  string(REGEX REPLACE ".*\\." "" section ${name})
-  set(compressed ${PROJECT_BINARY_DIR}/man/${name}.gz)
-  add_custom_command(OUTPUT ${compressed}
-    COMMAND ${CMAKE_COMMAND} -E make_directory ${PROJECT_BINARY_DIR}/man
-    COMMAND sh -c "gzip -9 -n -c \"$1\" > \"$2\"" gzip ${PROJECT_SOURCE_DIR}/${page} ${compressed}
-    DEPENDS ${PROJECT_SOURCE_DIR}/${page}
-    VERBATIM)
-  list(APPEND halvex_compressed_pages ${compressed})
-  install(FILES ${compressed} DESTINATION ${CMAKE_INSTALL_MANDIR}/man${section} COMPONENT tool)
-endforeach()
-add_custom_target(halvex_man_pages ALL DEPENDS ${halvex_compressed_pages})
+install(FILES man/halvextool.1 DESTINATION ${CMAKE_INSTALL_MANDIR}/man1 COMPONENT tool)
+install(FILES man/halvex-sim.8 DESTINATION ${CMAKE_INSTALL_MANDIR}/man8 COMPONENT tool)
 
 install(FILES completion/halvextool completion/halvex-sim
   DESTINATION ${HALVEX_COMPLETIONS_DIR} COMPONENT tool)
+install(FILES completion/_halvextool completion/_halvex-sim
+  DESTINATION ${HALVEX_ZSH_COMPLETIONS_DIR} COMPONENT tool)
 
 install(FILES data/dbus/org.halvex.conf
   DESTINATION ${CMAKE_INSTALL_DATADIR}/dbus-1/system.d COMPONENT tool)

@@ -7,8 +7,12 @@
 # from its prefix or root prefix (systemd's units: ${rootprefix}/lib/systemd/system) keeps what
 # follows that prefix; a literal path under the module's own prefix (bash-completion's
 # /usr/share/...) keeps what follows it. Anything else, or no module, gives the relative
-# <fallback>.
+# <fallback>. A value given on the command line (-D<out>=...) wins.
 function(halvex_pkg_config_dir out module variable fallback)
+  if(NOT "${${out}}" STREQUAL "")
+    message(STATUS "Install folder for ${module} ${variable}: ${${out}} (as set)")
+    return()
+  endif()
   set(dir "${fallback}")
   set(marker "/halvex-install-prefix")
   if(PKG_CONFIG_EXECUTABLE)
@@ -31,6 +35,7 @@ function(halvex_pkg_config_dir out module variable fallback)
 endfunction()
 
 # halvex_install_configured(<template> DESTINATION <dir> COMPONENT <component>)
+# <dir> is relative to the install prefix, or absolute.
 # Installs <template> without its ".in", with @prefix@ and @bindir@ replaced at install time by
 # the prefix actually installed to (cmake --install --prefix, or the packages' /usr), and
 # @PROJECT_VERSION@, @CMAKE_INSTALL_LIBDIR@, @CMAKE_INSTALL_INCLUDEDIR@ by this build's values.
@@ -40,6 +45,10 @@ function(halvex_install_configured template)
   get_filename_component(name "${template}" NAME)
   string(REGEX REPLACE "\\.in$" "" name "${name}")
   set(staged "${CMAKE_CURRENT_BINARY_DIR}/install-time/${name}")
+  set(destination "${ARG_DESTINATION}")
+  if(NOT IS_ABSOLUTE "${destination}")
+    set(destination "\${CMAKE_INSTALL_PREFIX}/${destination}")
+  endif()
   install(CODE "
     set(prefix \"\${CMAKE_INSTALL_PREFIX}\")
     set(bindir \"\${CMAKE_INSTALL_PREFIX}/${CMAKE_INSTALL_BINDIR}\")
@@ -47,14 +56,14 @@ function(halvex_install_configured template)
     set(CMAKE_INSTALL_LIBDIR \"${CMAKE_INSTALL_LIBDIR}\")
     set(CMAKE_INSTALL_INCLUDEDIR \"${CMAKE_INSTALL_INCLUDEDIR}\")
     configure_file(\"${template}\" \"${staged}\" @ONLY)
-    file(INSTALL \"${staged}\" DESTINATION \"\${CMAKE_INSTALL_PREFIX}/${ARG_DESTINATION}\"
+    file(INSTALL \"${staged}\" DESTINATION \"${destination}\"
          FILE_PERMISSIONS OWNER_READ OWNER_WRITE GROUP_READ WORLD_READ)"
     COMPONENT ${ARG_COMPONENT})
 endfunction()
 
 # halvex_strip_installed(<component> OPTIONS <strip options...> FILES <paths...>)
 # Runs strip with <options> on the installed <paths> (relative to the prefix) when the install
-# strips (cmake --install --strip, cpack): for what install(TARGETS) leaves, the debug sections
+# strips (cmake --install --strip): for what install(TARGETS) leaves, the debug sections
 # of static archives and the .comment and .note sections Debian's own strip removes.
 function(halvex_strip_installed component)
   cmake_parse_arguments(ARG "" "" "OPTIONS;FILES" ${ARGN})

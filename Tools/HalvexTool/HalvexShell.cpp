@@ -7,10 +7,10 @@
 #include <pthread.h>
 
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
 #include <optional>
 #include <string>
+#include <system_error>
 #include <utility>
 
 #include "Tools/HalvexTool/HalvexCommand.h"
@@ -97,7 +97,8 @@ int halvexMain(std::vector<std::string>& arguments) {
   const int ret = pthread_create(&shellThread, nullptr, shellThreadMain, &arguments);
   if (ret != 0) {
     // Not assert(): a release build must not carry on without its shell.
-    std::fprintf(stderr, "%s:%d: %s: Assertion `ret == 0' failed.\n", __FILE__, __LINE__, "main");
+    writeLine(consoleErr(), device::getProgramName() + ": cannot start the shell thread: " +
+                                std::generic_category().message(ret));
     std::abort();
   }
   platform::runMainLoop();

@@ -3,7 +3,9 @@
 # The whole test suite on a fresh Debian 12 machine: installs what is missing, then configures,
 # builds and runs every test under the plain (GCC), AddressSanitizer+UBSan, ThreadSanitizer and
 # clang presets, and last the fuzz preset, whose tests run each fuzz target over its seed corpus
-# for a few seconds. Arguments, if any, name the presets to run instead of all five.
+# for a few seconds. Each preset with tests also runs every test program whole, shuffled and
+# repeated (scripts/run-shuffled.sh). Arguments, if any, name the presets to run instead of all
+# five.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/packages.sh
@@ -19,10 +21,13 @@ for preset in "${presets[@]}"; do
   cmake --build --preset "${preset}" -j "${jobs}"
   # ThreadSanitizer cannot map its shadow memory under the kernel's largest address
   # randomisation, so its tests run with randomisation off.
-  if [[ ${preset} == tsan ]]; then
-    setarch "$(uname -m)" -R ctest --preset "${preset}" -j "${jobs}"
-  else
-    ctest --preset "${preset}" -j "${jobs}"
+  run=()
+  [[ ${preset} != tsan ]] || run=(setarch "$(uname -m)" -R)
+  "${run[@]}" ctest --preset "${preset}" -j "${jobs}"
+  # Then each test program once more, whole: its tests in one process, shuffled, three times.
+  # The fuzz preset has none.
+  if [[ -f build/${preset}/tests/programs.tsv ]]; then
+    bash scripts/run-shuffled.sh "build/${preset}" "${run[@]}"
   fi
   if [[ ${preset} == dev ]]; then bash scripts/check-packages.sh build/dev; fi
 done

@@ -3,6 +3,7 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <iterator>
 #include <mutex>
 #include <utility>
 
@@ -32,22 +33,28 @@ class Manager {
 
 namespace halvex::fake {
 
-struct FakePlatform::Impl {
-  mutable std::mutex mutex;
+// Everything reset() puts back to its start. Not in an anonymous namespace: Impl derives from it.
+struct FakeState {
   Device device;
   std::vector<std::string> calls;
-  ServerResponder serverResponder;
+  FakePlatform::ServerResponder serverResponder;
   std::vector<ServerRequest> serverRequests;
   std::vector<std::pair<std::string, MessageValue>> eventsOnDelivery;
   bool holding = false;
   std::vector<std::pair<WorkQueue, WorkQueue::Closure>> heldCompletions;
-  HelperResponder helperResponder;
+  FakePlatform::HelperResponder helperResponder;
   bool helperCreatable = true;
   std::vector<HelperRequest> helperRequests;
   std::vector<LogLine> logLines;
-  // Managers live as long as the process, as with the real framework, which keeps each one
-  // reachable from its registered handlers.
+  // The managers deliverEvent() posts to.
   std::vector<std::shared_ptr<client::Manager>> managers;
+};
+
+struct FakePlatform::Impl : FakeState {
+  mutable std::mutex mutex;
+  // Managers from before the last reset(). A manager lives as long as the process, as with the
+  // real framework, which keeps each one reachable from its registered handlers.
+  std::vector<std::shared_ptr<client::Manager>> retired;
 
   void record(std::string entry) {
     std::lock_guard lock(mutex);
@@ -93,8 +100,18 @@ FakePlatform::FakePlatform() : impl_(std::make_unique<Impl>()) {}
 
 FakePlatform& FakePlatform::get() {
   // Never destroyed: queues and handlers may still run while the process exits.
-  static FakePlatform* const platform = new FakePlatform();
+  static auto* const platform = new FakePlatform();
   return *platform;
+}
+
+void FakePlatform::reset() {
+  FakeState old;
+  {
+    std::lock_guard lock(impl_->mutex);
+    old = std::exchange(static_cast<FakeState&>(*impl_), FakeState());
+    std::move(old.managers.begin(), old.managers.end(), std::back_inserter(impl_->retired));
+  }
+  // The old closures and queues go here, outside the lock their threads may take.
 }
 
 FakePlatform::Impl& FakePlatform::impl() {

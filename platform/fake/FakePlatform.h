@@ -73,9 +73,14 @@ class FakePlatform {
   using HelperResponder =
       std::function<Answer(helper::TaskID, const std::string& command, const MessageDict&)>;
 
-  // The one fake of the process. Each test runs in a process of its own, so a test starts from
-  // the defaults: a device with radio type 1, vendor 1, nothing running, no server answers.
+  // The one fake of the process. It starts from the defaults, to which reset() returns it: a
+  // device with radio type 1, vendor 1, nothing running, no server or helper answers.
   static FakePlatform& get();
+
+  // Back to the defaults: every answer, hold and record goes, and deliverEvent() no longer posts
+  // to the managers created so far. For a test's set-up; closures already posted to a queue
+  // still run.
+  void reset();
 
   void setDevice(Device device);
   Device device() const;

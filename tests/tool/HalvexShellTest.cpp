@@ -9,6 +9,7 @@
 
 #include "Tools/HalvexTool/HalvexShell.h"
 #include "Tools/HalvexTool/ServerState.h"
+#include "tests/support/FreshProcess.h"
 #include "tests/tool/ToolTestSupport.h"
 
 namespace halvex {
@@ -16,8 +17,11 @@ namespace {
 
 using fake::FakePlatform;
 using Calls = std::vector<std::string>;
+using ToolStartup = tooltest::FreshTool;
+using HalvexShellSession = tooltest::FreshTool;
+using ServerState = tooltest::FreshTool;
 
-TEST(ToolStartup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
+TEST_F(ToolStartup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
   const std::string noRadio = "'halvextool' is not supported on this product.\n";
   const std::string refusal =
       "Telvane process is not running. Please run/load Telvane (or kelmond) and try again.\n";
@@ -47,7 +51,7 @@ TEST(ToolStartup, ChecksRadioThenDaemonsAskingOnlyWhatIsNeeded) {
 
 // The framework keeps its copy of the state handler, so the wait runs its full course; a state
 // delivered during it counts for the first command. The root is named after the program.
-TEST(HalvexShell, StartsTheServerSessionAndWaitsForItsState) {
+TEST_F(HalvexShellSession, StartsTheServerSessionAndWaitsForItsState) {
   auto& platform = FakePlatform::get();
   platform.setDevice({.programName = "hx"});
   platform.setEventsOnDelivery(
@@ -68,9 +72,14 @@ TEST(HalvexShell, StartsTheServerSessionAndWaitsForItsState) {
                    "EventsOff", "EventsOn", "getProgramName"}));
 }
 
+// Before any event: seen only in a process where nothing, not even a fixture, has sent one.
+TEST(ServerStateAtStart, IsNotStarted) {
+  test::inFreshProcess([] { EXPECT_FALSE(isServerStarted()); });
+}
+
 // Each row follows a "started" event, so every row shows that it overwrites the flag; "logdump"
 // refuses all but "bb" while the flag is off.
-TEST(ServerState, EveryEventOverwritesTheFlagThatLogdumpChecks) {
+TEST_F(ServerState, EveryEventOverwritesTheFlagThatLogdumpChecks) {
   const auto logdump = tooltest::makeLogdump();
   const auto state = [](MessageValue value) {
     return tooltest::dictOf({{kKeyServerState, std::move(value)}});
@@ -88,7 +97,6 @@ TEST(ServerState, EveryEventOverwritesTheFlagThatLogdumpChecks) {
       state(MessageValue::string(text + " ")),
       state(MessageValue::string(text.substr(0, 3))),
   };
-  EXPECT_FALSE(isServerStarted());
   for (const MessageValue& payload : payloads) {
     SCOPED_TRACE(describe(payload));
     onServerStateChange(started, TaskGroup());

@@ -17,6 +17,7 @@ using tooltest::failed;
 using tooltest::kPath;
 using tooltest::ok;
 using tooltest::ServerScript;
+using LogCollection = tooltest::FreshTool;
 
 const std::string kScratch = "Path = /var/wireless/Library/Logs/Halvex/DIAG.scratch\n";
 
@@ -38,7 +39,7 @@ fake::Answer property(const std::string& text) {
   return tooltest::valued(kKeyTracePropertyValue, text);
 }
 
-TEST(LogCollection, OutcomesOfEveryCollection) {
+TEST_F(LogCollection, OutcomesOfEveryCollection) {
   const std::string tel = "Telephony log collection: Success\n";
   const std::string core = "Telephony log collection with Coredump: Success\n";
   const std::string running = "Baseband log collection: Success (Halvex running)\n" + kPath;
@@ -118,7 +119,7 @@ TEST(LogCollection, OutcomesOfEveryCollection) {
 }
 
 // Each request as "command sync|async {keys}", so that a row states every request in order.
-TEST(LogCollection, RequestsFollowTheWordsInKeyOrder) {
+TEST_F(LogCollection, RequestsFollowTheWordsInKeyOrder) {
   ServerScript().install();
   const std::string core =
       R"(TraceDumpState async {"BasebandResetType": "Hard", "BasebandResetSubType": )"
@@ -150,7 +151,7 @@ TEST(LogCollection, RequestsFollowTheWordsInKeyOrder) {
 }
 
 // The shell's wait covers the completion: runOption must not return before it has run.
-TEST(LogCollection, AsynchronousOptionsReturnOnlyAfterTheirCompletion) {
+TEST_F(LogCollection, AsynchronousOptionsReturnOnlyAfterTheirCompletion) {
   ServerScript().install();
   tooltest::CapturedConsole console;
   const auto logdump = tooltest::makeLogdump();

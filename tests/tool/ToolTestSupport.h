@@ -1,7 +1,10 @@
 // SPDX-License-Identifier: MIT
-// Shared by the tool's unit tests: captured console streams, a fake server script and a
-// "logdump" command wired to the fake platform.
+// Shared by the tool's unit tests: the fixture that starts each from a new process's state,
+// captured console streams, a fake server script and a "logdump" command wired to the fake
+// platform.
 #pragma once
+
+#include <gtest/gtest.h>
 
 #include <memory>
 #include <sstream>
@@ -10,14 +13,31 @@
 #include <vector>
 
 #include "Tools/HalvexTool/LogdumpCommand.h"
+#include "Tools/HalvexTool/ServerState.h"
 #include "platform/MessageDict.h"
 #include "platform/ServerClient.h"
 #include "platform/ServerProtocol.h"
+#include "platform/TaskGroup.h"
 #include "platform/WorkQueue.h"
 #include "platform/fake/FakePlatform.h"
 #include "shell/Console.h"
 
 namespace halvex::tooltest {
+
+// Every event overwrites the server-started flag: one without a state clears it, as at start.
+inline void resetServerStateForTesting() {
+  onServerStateChange(MessageValue::null(), TaskGroup());
+}
+
+// For tests that use the fake platform or the server-started flag: both start as in a new
+// process, whatever ran before in this one.
+class FreshTool : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    fake::FakePlatform::get().reset();
+    resetServerStateForTesting();
+  }
+};
 
 struct CapturedConsole {
   std::istringstream in;
@@ -26,10 +46,10 @@ struct CapturedConsole {
   ScopedConsoleForTesting scope{in, out, err};
 };
 
-inline MessageValue dictOf(std::vector<std::pair<std::string, MessageValue>> entries) {
+inline MessageValue dictOf(const std::vector<std::pair<std::string, MessageValue>>& entries) {
   MessageDict dict;
-  for (auto& [key, value] : entries) {
-    dict.set(key, std::move(value));
+  for (const auto& [key, value] : entries) {
+    dict.set(key, value);
   }
   return MessageValue::dict(std::move(dict));
 }

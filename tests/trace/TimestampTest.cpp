@@ -3,6 +3,8 @@
 
 #include <cstdlib>
 #include <ctime>
+#include <optional>
+#include <string>
 #include <utility>
 
 #include "halvex/trace/Timestamp.h"
@@ -12,10 +14,30 @@ namespace {
 
 using Format = Timestamp::Format;
 
-void useZone(const char* zone) {
-  setenv("TZ", zone, 1);
-  tzset();
-}
+// The local time zone for this object's lifetime; the process's own comes back afterwards.
+class ScopedZone {
+ public:
+  explicit ScopedZone(const char* zone) {
+    if (const char* saved = std::getenv("TZ")) {
+      saved_ = saved;
+    }
+    setenv("TZ", zone, 1);
+    tzset();
+  }
+  ~ScopedZone() {
+    if (saved_) {
+      setenv("TZ", saved_->c_str(), 1);
+    } else {
+      unsetenv("TZ");
+    }
+    tzset();
+  }
+  ScopedZone(const ScopedZone&) = delete;
+  ScopedZone& operator=(const ScopedZone&) = delete;
+
+ private:
+  std::optional<std::string> saved_;
+};
 
 Timestamp stampAt(long seconds, long microseconds, Timestamp::TimeDomain domain) {
   Timestamp stamp;
@@ -50,7 +72,7 @@ TEST(Timestamp, RendersEveryFormInEveryZone) {
   const std::pair<const char*, const char * Row::*> zones[] = {
       {"UTC0", &Row::utc}, {"<+0530>-5:30", &Row::east}, {"<-08>8", &Row::west}};
   for (const auto& [zone, column] : zones) {
-    useZone(zone);
+    const ScopedZone scoped(zone);
     for (const Row& row : rows) {
       EXPECT_EQ(stamp.asString(Timestamp::kBaseband, row.format), row.*column)
           << zone << " format " << row.format;
@@ -59,7 +81,7 @@ TEST(Timestamp, RendersEveryFormInEveryZone) {
 }
 
 TEST(Timestamp, FractionsAndMissingDomains) {
-  useZone("UTC0");
+  const ScopedZone utc("UTC0");
   const Format date = Timestamp::kFormatDate;
   const Format ms = Timestamp::kFormatMilliseconds;
   // Milliseconds are cut, not rounded.

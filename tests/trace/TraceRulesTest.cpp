@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: MIT
 // The trace library's device-dependent rules and cached values, on the fake platform: each test
-// starts from a device of its choosing and then reads the platform calls the code made.
+// starts from a device of its choosing and then reads the platform calls the code made. A test
+// that reads a value the library keeps from its first use runs in a fresh process.
 #include <gtest/gtest.h>
 
 #include <climits>
@@ -19,6 +20,7 @@
 #include "halvex/trace/LogLocations.h"
 #include "halvex/trace/TraceCatalog.h"
 #include "platform/fake/FakePlatform.h"
+#include "tests/support/FreshProcess.h"
 
 namespace halvex::trace {
 namespace {
@@ -72,18 +74,20 @@ TEST(DeviceIdentity, BuildTypeRulesAskLazilyAndAfresh) {
 }
 
 TEST(DeviceIdentity, GlobalLoggerKeepsTheFirstServer) {
-  const auto first = LogServer::create(), second = LogServer::create();
-  useDevice({});
-  const Logger& logger = getGlobalLogger(first);
-  EXPECT_EQ(&getGlobalLogger(second), &logger);
-  EXPECT_EQ(logger.server(), first);
-  EXPECT_EQ(takeCalls(), Calls{});
-  logger.log(LogLevel::kNotice, "hello");
-  const auto lines = fake::FakePlatform::get().logLines();
-  ASSERT_EQ(lines.size(), 1U);
-  EXPECT_EQ(lines[0].subsystem, getGlobalLogContext().subsystem());
-  EXPECT_TRUE(std::regex_match(lines[0].subsystem, std::regex(R"([a-z]+(\.[a-z]+)+)")));
-  EXPECT_EQ(lines[0].category + " " + lines[0].message, "global hello");
+  test::inFreshProcess([] {
+    const auto first = LogServer::create(), second = LogServer::create();
+    useDevice({});
+    const Logger& logger = getGlobalLogger(first);
+    EXPECT_EQ(&getGlobalLogger(second), &logger);
+    EXPECT_EQ(logger.server(), first);
+    EXPECT_EQ(takeCalls(), Calls{});
+    logger.log(LogLevel::kNotice, "hello");
+    const auto lines = fake::FakePlatform::get().logLines();
+    ASSERT_EQ(lines.size(), 1U);
+    EXPECT_EQ(lines[0].subsystem, getGlobalLogContext().subsystem());
+    EXPECT_TRUE(std::regex_match(lines[0].subsystem, std::regex(R"([a-z]+(\.[a-z]+)+)")));
+    EXPECT_EQ(lines[0].category + " " + lines[0].message, "global hello");
+  });
 }
 
 template <typename Enum>
@@ -159,29 +163,31 @@ class CachedFirstCall : public ::testing::TestWithParam<FirstCall> {};
 // Many threads make the first call at once: the platform is asked once and all see one value,
 // which stays when the device changes later.
 TEST_P(CachedFirstCall, AsksOnceAndKeepsTheAnswer) {
-  const FirstCall& first = GetParam();
-  useDevice(first.device);
-  constexpr int kThreads = 8;
-  std::latch start(kThreads);
-  std::vector<std::string> results(kThreads);
-  {
-    std::vector<std::jthread> threads;
-    for (std::size_t i = 0; i < kThreads; ++i) {
-      threads.emplace_back([&, i] {
-        start.arrive_and_wait();
-        results[i] = first.call();
-      });
+  test::inFreshProcess([&] {
+    const FirstCall& first = GetParam();
+    useDevice(first.device);
+    constexpr int kThreads = 8;
+    std::latch start(kThreads);
+    std::vector<std::string> results(kThreads);
+    {
+      std::vector<std::jthread> threads;
+      for (std::size_t i = 0; i < kThreads; ++i) {
+        threads.emplace_back([&, i] {
+          start.arrive_and_wait();
+          results[i] = first.call();
+        });
+      }
     }
-  }
-  EXPECT_EQ(takeCalls(), first.queries);
-  EXPECT_EQ(results, std::vector<std::string>(kThreads, results[0]));
-  EXPECT_TRUE(std::regex_match(results[0], std::regex(first.answer))) << results[0];
-  useDevice({.radioType = first.device.radioType == 5 ? 6 : 5,
-             .radioVendor = first.device.radioVendor == 1 ? 2 : 1,
-             .traceAllowed = !first.device.traceAllowed,
-             .properties = {{"boot-args", "changed"}}});
-  EXPECT_EQ(first.call(), results[0]);
-  EXPECT_EQ(takeCalls(), Calls{});
+    EXPECT_EQ(takeCalls(), first.queries);
+    EXPECT_EQ(results, std::vector<std::string>(kThreads, results[0]));
+    EXPECT_TRUE(std::regex_match(results[0], std::regex(first.answer))) << results[0];
+    useDevice({.radioType = first.device.radioType == 5 ? 6 : 5,
+               .radioVendor = first.device.radioVendor == 1 ? 2 : 1,
+               .traceAllowed = !first.device.traceAllowed,
+               .properties = {{"boot-args", "changed"}}});
+    EXPECT_EQ(first.call(), results[0]);
+    EXPECT_EQ(takeCalls(), Calls{});
+  });
 }
 
 INSTANTIATE_TEST_SUITE_P(Caches, CachedFirstCall, ::testing::ValuesIn(firstCalls()),
@@ -190,43 +196,47 @@ INSTANTIATE_TEST_SUITE_P(Caches, CachedFirstCall, ::testing::ValuesIn(firstCalls
 // Each radio-dependent rule against every radio type, on an internal build with tracing allowed:
 // the radios it holds for, and that it asks the radio afresh while the permission stays cached.
 TEST(TraceCatalog, RadioRulesAcrossEveryType) {
-  const std::set<int> none = {INT_MIN, -1, 0, 11, INT_MAX};
-  const std::tuple<const char*, std::function<bool()>, std::set<int>> rules[] = {
-      {"nonPCI", isNonPCIRadio, {1, 2, 8}},
-      {"PCI", isPCIRadio, {INT_MIN, -1, 0, 3, 4, 5, 6, 7, 9, 10, 11, INT_MAX}},
-      {"not9Or10", isNotType9Or10Radio, {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 11, INT_MAX}},
-      {"coreDumpStatus", isCoreDumpStatusSupported, {1, 2, 3, 8}},
-      {"kernelPCI", isKernelPCITraceSupported, {3, 4, 5, 6, 7, 9, 10}},
-      {"basebandIPC", [] { return isSupported(kBasebandIPC); }, {1, 2, 3, 4, 5, 6, 7, 8, 9, 10}},
-      {"dumpLogIndication", isDumpLogIndicationSupported, {1, 2, 3, 4, 6, 8, 9}},
-  };
-  ASSERT_TRUE(isAllowed());
-  for (const auto& [name, rule, holds] : rules) {
-    for (int radio : {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, INT_MAX}) {
-      useDevice({.radioType = radio, .internalBuild = true});
-      EXPECT_EQ(rule(), holds.contains(radio)) << name << " radio " << radio;
-      const Calls asked = std::string(name) == "dumpLogIndication"
-                              ? Calls{"isInternalBuild", "getRadioType"}
-                              : Calls{"getRadioType"};
-      EXPECT_EQ(takeCalls(), asked) << name << " radio " << radio;
+  test::inFreshProcess([] {
+    const std::set<int> none = {INT_MIN, -1, 0, 11, INT_MAX};
+    const std::tuple<const char*, std::function<bool()>, std::set<int>> rules[] = {
+        {"nonPCI", isNonPCIRadio, {1, 2, 8}},
+        {"PCI", isPCIRadio, {INT_MIN, -1, 0, 3, 4, 5, 6, 7, 9, 10, 11, INT_MAX}},
+        {"not9Or10", isNotType9Or10Radio, {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 11, INT_MAX}},
+        {"coreDumpStatus", isCoreDumpStatusSupported, {1, 2, 3, 8}},
+        {"kernelPCI", isKernelPCITraceSupported, {3, 4, 5, 6, 7, 9, 10}},
+        {"basebandIPC", [] { return isSupported(kBasebandIPC); }, {1, 2, 3, 4, 5, 6, 7, 8, 9, 10}},
+        {"dumpLogIndication", isDumpLogIndicationSupported, {1, 2, 3, 4, 6, 8, 9}},
+    };
+    ASSERT_TRUE(isAllowed());
+    for (const auto& [name, rule, holds] : rules) {
+      for (int radio : {INT_MIN, -1, 0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, INT_MAX}) {
+        useDevice({.radioType = radio, .internalBuild = true});
+        EXPECT_EQ(rule(), holds.contains(radio)) << name << " radio " << radio;
+        const Calls asked = std::string(name) == "dumpLogIndication"
+                                ? Calls{"isInternalBuild", "getRadioType"}
+                                : Calls{"getRadioType"};
+        EXPECT_EQ(takeCalls(), asked) << name << " radio " << radio;
+      }
     }
-  }
+  });
 }
 
 // The permission is asked only when the radio leaves the answer open; that its first answer
 // stays is checked with the other cached values.
 TEST(TraceCatalog, PermissionIsAskedOnlyWhenNeeded) {
-  for (int radio : {-1, 0, 11}) {
-    useDevice({.radioType = radio, .traceAllowed = false});
-    EXPECT_FALSE(isKernelPCITraceSupported() || isSupported("basebandipc")) << radio;
-    EXPECT_EQ(takeCalls(), (Calls{"getRadioType", "getRadioType"})) << radio;
-  }
-  useDevice({.radioType = 8, .traceAllowed = false});
-  EXPECT_FALSE(isKernelPCITraceSupported());
-  EXPECT_EQ(takeCalls(), Calls{"getRadioType"});
-  useDevice({.radioType = 9, .traceAllowed = false});
-  EXPECT_FALSE(isSupported("BasebandIPC"));
-  EXPECT_EQ(takeCalls(), (Calls{"getRadioType", "isTraceAllowed"}));
+  test::inFreshProcess([] {
+    for (int radio : {-1, 0, 11}) {
+      useDevice({.radioType = radio, .traceAllowed = false});
+      EXPECT_FALSE(isKernelPCITraceSupported() || isSupported("basebandipc")) << radio;
+      EXPECT_EQ(takeCalls(), (Calls{"getRadioType", "getRadioType"})) << radio;
+    }
+    useDevice({.radioType = 8, .traceAllowed = false});
+    EXPECT_FALSE(isKernelPCITraceSupported());
+    EXPECT_EQ(takeCalls(), Calls{"getRadioType"});
+    useDevice({.radioType = 9, .traceAllowed = false});
+    EXPECT_FALSE(isSupported("BasebandIPC"));
+    EXPECT_EQ(takeCalls(), (Calls{"getRadioType", "isTraceAllowed"}));
+  });
 }
 
 // The catalogue once with tracing allowed and once, in its own process, with it denied. The
@@ -234,36 +244,38 @@ TEST(TraceCatalog, PermissionIsAskedOnlyWhenNeeded) {
 class SupportedNames : public ::testing::TestWithParam<bool> {};
 
 TEST_P(SupportedNames, FollowTheCatalogue) {
-  const bool allowed = GetParam();
-  struct Group {
-    std::vector<std::string> names;
-    int vendor;
-    bool whenAllowed, whenDenied;
-    const char* asks;
-  };
-  const char* const vendor = "getRadioVendor";
-  const Group groups[] = {
-      {{"Halvex", std::string("HALVEX\0junk", 11), "BASEBANDTRACE"}, 0, true, true, ""},
-      {{"coredump", "pRoFiLe"}, 0, true, true, ""},
-      {{"DIAG", "vimocoredump"}, 2, true, true, vendor},
-      {{"QoroTrace", "QoroCoreDump"}, 1, true, true, vendor},
-      {{"diag", "VimoCoreDump"}, 1, false, false, vendor},
-      {{"qorotrace"}, 2, false, false, vendor},
-      {{"qorocoredump"}, 3, false, false, vendor},
-      {{"BasebandIPC"}, 0, true, false, "getRadioType"},
-      {{"ipc", "COMPRESSION", "tixo", "SystemLogs", "ddt", "Settings"}, 0, true, false, ""},
-      {{"CSILog", "TelephonyLog", "", "Halvex ", "Snaptrail"}, 2, false, false, ""},
-  };
-  useDevice({.radioType = 4, .traceAllowed = allowed});
-  EXPECT_EQ(isAllowed(), allowed);
-  for (const Group& group : groups) {
-    for (const std::string& name : group.names) {
-      SCOPED_TRACE('"' + name + "\" vendor " + std::to_string(group.vendor));
-      useDevice({.radioType = 4, .radioVendor = group.vendor, .traceAllowed = allowed});
-      EXPECT_EQ(isSupported(name), allowed ? group.whenAllowed : group.whenDenied);
-      EXPECT_EQ(takeCalls(), *group.asks != '\0' ? Calls{group.asks} : Calls{});
+  test::inFreshProcess([&] {
+    const bool allowed = GetParam();
+    struct Group {
+      std::vector<std::string> names;
+      int vendor;
+      bool whenAllowed, whenDenied;
+      const char* asks;
+    };
+    const char* const vendor = "getRadioVendor";
+    const Group groups[] = {
+        {{"Halvex", std::string("HALVEX\0junk", 11), "BASEBANDTRACE"}, 0, true, true, ""},
+        {{"coredump", "pRoFiLe"}, 0, true, true, ""},
+        {{"DIAG", "vimocoredump"}, 2, true, true, vendor},
+        {{"QoroTrace", "QoroCoreDump"}, 1, true, true, vendor},
+        {{"diag", "VimoCoreDump"}, 1, false, false, vendor},
+        {{"qorotrace"}, 2, false, false, vendor},
+        {{"qorocoredump"}, 3, false, false, vendor},
+        {{"BasebandIPC"}, 0, true, false, "getRadioType"},
+        {{"ipc", "COMPRESSION", "tixo", "SystemLogs", "ddt", "Settings"}, 0, true, false, ""},
+        {{"CSILog", "TelephonyLog", "", "Halvex ", "Snaptrail"}, 2, false, false, ""},
+    };
+    useDevice({.radioType = 4, .traceAllowed = allowed});
+    EXPECT_EQ(isAllowed(), allowed);
+    for (const Group& group : groups) {
+      for (const std::string& name : group.names) {
+        SCOPED_TRACE('"' + name + "\" vendor " + std::to_string(group.vendor));
+        useDevice({.radioType = 4, .radioVendor = group.vendor, .traceAllowed = allowed});
+        EXPECT_EQ(isSupported(name), allowed ? group.whenAllowed : group.whenDenied);
+        EXPECT_EQ(takeCalls(), *group.asks != '\0' ? Calls{group.asks} : Calls{});
+      }
     }
-  }
+  });
 }
 
 INSTANTIATE_TEST_SUITE_P(Permission, SupportedNames, ::testing::Bool());

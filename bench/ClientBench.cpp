@@ -96,7 +96,7 @@ void BM_AsyncPerform(benchmark::State& state) {
     handoff->finished = false;
     client::PerformCommand(
         manager, kCommand,
-        [handoff](Result result, MessageValue) {
+        [handoff](Result result, const MessageValue&) {
           {
             std::lock_guard lock(handoff->mutex);
             handoff->last = std::move(result);

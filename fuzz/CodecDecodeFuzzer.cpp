@@ -7,6 +7,7 @@
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
+#include <cstddef>
 #include <cstdint>
 #include <cstring>
 #include <memory>
@@ -43,18 +44,10 @@ TypeRef makeType(char code, std::vector<TypeRef> members = {}) {
   }
   type->members = std::move(members);
   switch (code) {
-    case 'a':
-      type->signature = "a" + inner;
-      break;
-    case 'e':
-      type->signature = "{" + inner + "}";
-      break;
-    case 'r':
-      type->signature = "(" + inner + ")";
-      break;
-    default:
-      type->signature = std::string(1, code);
-      break;
+    case 'a': type->signature = "a" + inner; break;
+    case 'e': type->signature = "{" + inner + "}"; break;
+    case 'r': type->signature = "(" + inner + ")"; break;
+    default: type->signature = std::string(1, code); break;
   }
   return type;
 }
@@ -86,18 +79,12 @@ class Builder {
   // Mostly what the mapping covers, sometimes anything.
   TypeRef mappedType() {
     switch (in_.byte() % 8) {
-      case 0:
-        return dictType();
-      case 1:
-        return makeType('s');
-      case 2:
-        return makeType('x');
-      case 3:
-        return makeType('b');
-      case 4:
-        return makeType('g');
-      default:
-        return anyType(0);
+      case 0: return dictType();
+      case 1: return makeType('s');
+      case 2: return makeType('x');
+      case 3: return makeType('b');
+      case 4: return makeType('g');
+      default: return anyType(0);
     }
   }
 
@@ -108,18 +95,17 @@ class Builder {
       return makeType(kBasicTypes[choice % kBasicCount]);
     }
     switch (kind) {
-      case 12:
-        return makeType('v');
-      case 13:
-        return makeType('a', {anyType(depth + 1)});
+      case 12: return makeType('v');
+      case 13: return makeType('a', {anyType(depth + 1)});
       case 14: {
         TypeRef key = makeType(kBasicTypes[in_.byte() % kBasicCount]);
         return makeType('a', {makeType('e', {std::move(key), anyType(depth + 1)})});
       }
       default: {
         std::vector<TypeRef> members;
-        const int count = 1 + in_.byte() % 3;
-        for (int i = 0; i < count; ++i) {
+        const std::size_t count = 1U + in_.byte() % 3U;
+        members.reserve(count);
+        for (std::size_t i = 0; i < count; ++i) {
           members.push_back(anyType(depth + 1));
         }
         return makeType('r', std::move(members));
@@ -129,14 +115,10 @@ class Builder {
 
   Value topValue() {
     switch (in_.byte() % 4) {
-      case 0:
-        return value(dictType());
-      case 1:
-        return value(makeType('v'));
-      case 2:
-        return value(anyType(0));
-      default:
-        return value(mappedType());
+      case 0: return value(dictType());
+      case 1: return value(makeType('v'));
+      case 2: return value(anyType(0));
+      default: return value(mappedType());
     }
   }
 
@@ -151,35 +133,21 @@ class Builder {
         out.bits = in_.byte();
         break;
       case 'n':
-      case 'q':
-        out.bits = in_.integer<std::uint16_t>();
-        break;
+      case 'q': out.bits = in_.integer<std::uint16_t>(); break;
       case 'i':
-      case 'u':
-        out.bits = in_.integer<std::uint32_t>();
-        break;
+      case 'u': out.bits = in_.integer<std::uint32_t>(); break;
       case 'x':
       case 't':
-      case 'd':
-        out.bits = in_.integer<std::uint64_t>();
-        break;
+      case 'd': out.bits = in_.integer<std::uint64_t>(); break;
       case 's':
         // sd-bus takes C strings: what follows a NUL never reaches the message.
         out.text = in_.text();
         out.text.resize(std::strlen(out.text.c_str()));
         break;
-      case 'o':
-        out.text = kObjectPaths[in_.byte() % std::size(kObjectPaths)];
-        break;
-      case 'g':
-        out.text = kSignatures[in_.byte() % std::size(kSignatures)];
-        break;
-      case 'v':
-        out.items.push_back(value(budget_ > 0 ? mappedType() : makeType('b')));
-        break;
-      case 'a':
-        fillArray(out);
-        break;
+      case 'o': out.text = kObjectPaths[in_.byte() % std::size(kObjectPaths)]; break;
+      case 'g': out.text = kSignatures[in_.byte() % std::size(kSignatures)]; break;
+      case 'v': out.items.push_back(value(budget_ > 0 ? mappedType() : makeType('b'))); break;
+      case 'a': fillArray(out); break;
       default:  // 'e' and 'r'
         for (const TypeRef& member : type->members) {
           out.items.push_back(value(member));
@@ -246,14 +214,11 @@ int append(sd_bus_message* message, const Value& value) {
     }
     case 'x':
     case 't':
-    case 'd':
-      return sd_bus_message_append_basic(message, code, &value.bits);
+    case 'd': return sd_bus_message_append_basic(message, code, &value.bits);
     case 's':
     case 'o':
-    case 'g':
-      return sd_bus_message_append_basic(message, code, value.text.c_str());
-    default:
-      break;
+    case 'g': return sd_bus_message_append_basic(message, code, value.text.c_str());
+    default: break;
   }
   const std::string& own = value.type->signature;
   std::string contents;
@@ -379,8 +344,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   FuzzInput in(data, size);
   Builder builder(in);
   std::vector<Value> body;
-  const int count = 1 + in.byte() % 3;
-  for (int i = 0; i < count; ++i) {
+  const std::size_t count = 1U + in.byte() % 3U;
+  body.reserve(count);
+  for (std::size_t i = 0; i < count; ++i) {
     body.push_back(builder.topValue());
   }
   Message message = newMessage();

@@ -40,7 +40,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   parseDumpOptions(words, compress, reason, nonui);
   check(compress == wantCompress, "nocompress before the reason clears compress");
   check(nonui == wantNonui, "nonui before the reason sets nonui");
-  check(reason == wantReason, "the first other word is the reason", [&] { return reason; });
+  check(reason == wantReason, "the first other word is the reason", reason);
   check(words == wantLeft, "the words after the reason stay, in order");
   return 0;
 }

@@ -38,6 +38,13 @@ inline void check(bool holds, const char* property, const Detail& detail) {
   }
 }
 
+// The same with a message already at hand.
+inline void check(bool holds, const char* property, const std::string& detail) {
+  if (!holds) {
+    fail(property, detail);
+  }
+}
+
 // The pieces of text between separators, as getline would read them: a trailing separator ends
 // the last piece rather than starting an empty one.
 inline std::vector<std::string> split(const std::string& text, char separator) {

@@ -39,7 +39,7 @@ struct Session {
 };
 
 Session& session() {
-  static Session* const instance = new Session();
+  static auto* const instance = new Session();
   return *instance;
 }
 
@@ -72,20 +72,13 @@ Answer property(const char* text) {
 // Time stamps stay plain so that the output cannot imitate a prompt.
 Answer dumpAnswer(unsigned choice) {
   switch (choice) {
-    case 0:
-      return ok(dictWith(kKeyTimestampString, MessageValue::string("T1")));
-    case 1:
-      return ok(MessageValue::dict({}));
-    case 2:
-      return ok(MessageValue::null());
-    case 3:
-      return failed(kResultServerNotRunning);
-    case 4:
-      return failed(kResultTimeout);
-    case 5:
-      return ok(MessageValue::string("T2"));
-    default:
-      return ok(dictWith(kKeyTimestampString, MessageValue::int64(7)));
+    case 0: return ok(dictWith(kKeyTimestampString, MessageValue::string("T1")));
+    case 1: return ok(MessageValue::dict({}));
+    case 2: return ok(MessageValue::null());
+    case 3: return failed(kResultServerNotRunning);
+    case 4: return failed(kResultTimeout);
+    case 5: return ok(MessageValue::string("T2"));
+    default: return ok(dictWith(kKeyTimestampString, MessageValue::int64(7)));
   }
 }
 
@@ -175,8 +168,7 @@ void checkRequests(const Scene& scene, const std::vector<std::string>& lines) {
           [&] { return request.command; });
     const std::string reason = request.request.getString(kKeyTraceDumpStateReason) +
                                request.request.getString(kKeyBasebandResetReason);
-    check(reason.starts_with(kReasonPrefix), "every dump carries the tool's reason",
-          [&] { return reason; });
+    check(reason.starts_with(kReasonPrefix), "every dump carries the tool's reason", reason);
   }
   check(scene.started || telephony + coredump == 0,
         "nothing is collected before the server starts");
@@ -231,8 +223,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const std::string errText = err.str();
   for (std::size_t at = 0; at < errText.size(); at += refusal.size()) {
     check(!scene.started && errText.compare(at, refusal.size(), refusal) == 0,
-          "standard error holds only the refusal, and only before the server starts",
-          [&] { return errText; });
+          "standard error holds only the refusal, and only before the server starts", errText);
   }
 
   std::string outText = out.str();

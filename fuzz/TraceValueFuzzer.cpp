@@ -54,8 +54,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   std::int32_t value = kUntouched;
   const bool parsed = halvex::parseTraceValue(text, value);
   const std::optional<std::int32_t> want = expected(text);
-  check(parsed == want.has_value(), "accepted exactly the named words and whole integers",
-        [&] { return text; });
+  check(parsed == want.has_value(), "accepted exactly the named words and whole integers", text);
   check(value == want.value_or(kUntouched), "the value read, or the value left alone",
         [&] { return std::to_string(value); });
   return 0;

@@ -7,8 +7,8 @@
 #include <atomic>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <iostream>
+#include <system_error>
 
 #include "shell/editor/Terminal.h"
 
@@ -93,7 +93,7 @@ std::optional<std::string> consoleOutError() {
   const int error = gStandardOutputClosed ? EBADF : gFirstLoss.load(std::memory_order_relaxed);
   std::string reason = "write error";
   if (error > 0) {
-    reason.append(": ").append(std::strerror(error));
+    reason.append(": ").append(std::generic_category().message(error));
   }
   return reason;
 }

@@ -7,6 +7,7 @@
 #include <pthread.h>
 
 #include <chrono>
+#include <cstddef>
 #include <cstdlib>
 #include <optional>
 #include <string>
@@ -51,7 +52,7 @@ std::shared_ptr<CommandBase> HalvexShell::createRootCommand() {
     // Every copy of the handler holds startupGroup; the manager keeps one for as long as the
     // handler is registered.
     client::EventHandler handler = [manager, hold = TaskGroupHold(startupGroup)](
-                                       MessageValue payload, TaskGroup group) {
+                                       const MessageValue& payload, TaskGroup group) {
       onServerStateChange(payload, std::move(group));
     };
     client::RegisterEventHandler(manager, kEventServerStateChange, handler);
@@ -67,6 +68,7 @@ std::shared_ptr<CommandBase> HalvexShell::createRootCommand() {
 
 std::vector<std::string> makeArgumentList(int argc, char* argv[]) {
   std::vector<std::string> arguments;
+  arguments.reserve(argc > 0 ? static_cast<std::size_t>(argc) : 0);
   for (int i = 0; i < argc; ++i) {
     arguments.emplace_back(argv[i]);
   }
@@ -109,13 +111,13 @@ void* shellThreadMain(void* arguments) {
   std::vector<std::string> list = *static_cast<const std::vector<std::string>*>(arguments);
   // Never destroyed: exit() ends the process with the shell, its tree and its session alive.
   auto shell = std::make_shared<HalvexShell>();
-  const bool ok = shell->run(std::move(list));
+  int status = shell->run(std::move(list)) ? 0 : 1;
   // As the standard tools do: output that was lost makes the run a failure, and says why.
   if (std::optional<std::string> lost = consoleOutError()) {
     writeLine(consoleErr(), device::getProgramName() + ": " + *lost);
-    std::exit(1);
+    status = 1;
   }
-  std::exit(ok ? 0 : 1);
+  std::exit(status);  // NOLINT(concurrency-mt-unsafe), see .clang-tidy
 }
 
 }  // namespace halvex

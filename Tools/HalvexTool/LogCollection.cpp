@@ -103,7 +103,7 @@ bool collectTelephonyLogs(const HalvexCommandBase& command, TaskGroup group,
   // Every copy of the completion holds the group, so the shell waits until the framework has run
   // and dropped its copy. The completion must not reach back into the command.
   const client::Completion completion = [hold = TaskGroupHold(group), compression](
-                                            Result result, MessageValue reply) {
+                                            const Result& result, const MessageValue& reply) {
     printTelephonyLogResult(result, reply, compression);
   };
   client::PerformCommand(command.manager(), kCommandTraceDumpState, completion, request);
@@ -134,8 +134,8 @@ bool collectTelephonyLogsWithCoredump(const HalvexCommandBase& command, TaskGrou
     request.set(kKeyTraceUserConfirmation, MessageValue::boolean(false));
   }
 
-  const client::Completion completion = [hold = TaskGroupHold(group)](Result result,
-                                                                      MessageValue reply) {
+  const client::Completion completion = [hold = TaskGroupHold(group)](const Result& result,
+                                                                      const MessageValue& reply) {
     printCoredumpLogResult(result, reply);
   };
   client::PerformCommand(command.manager(), kCommandTraceDumpState, completion, request);

@@ -17,7 +17,7 @@ namespace {
 constexpr std::chrono::milliseconds kSequenceWait{50};
 // How long a paste may pause before its end marker counts as lost.
 constexpr std::chrono::milliseconds kPasteWait{1000};
-constexpr std::size_t kReadSize = 64 * 1024;
+constexpr std::size_t kReadSize = std::size_t{64} * 1024;
 constexpr std::string_view kBell = "\x07";
 
 // The longest start all candidates share, cut back to whole characters.

@@ -29,8 +29,9 @@ TEST(MessageDictTest, KeysKeepInsertionOrderAndReplacingKeepsPosition) {
   dict.set("n", MessageValue::boolean(false));
   EXPECT_EQ(describe(MessageValue::dict(dict)),
             R"({"s": "q\"\\", "n": false, "b": true, "z": null, "d": {}})");
-  for (const char* key : {"absent", "n", "z", "d"})
+  for (const char* key : {"absent", "n", "z", "d"}) {
     EXPECT_EQ(dict.getString(key, "default"), "default") << key;
+  }
   dict.set(binary, MessageValue::string(binary));
   dict.set("a", MessageValue::string(""));
   EXPECT_EQ(dict.getString(binary, "default"), binary);
@@ -38,10 +39,12 @@ TEST(MessageDictTest, KeysKeepInsertionOrderAndReplacingKeepsPosition) {
 
   // Equal only with the same keys in the same order.
   MessageDict same, reversed;
-  for (const auto& [key, value] : dict.entries())
+  for (const auto& [key, value] : dict.entries()) {
     same.set(key, value);
-  for (auto entry = dict.entries().rbegin(); entry != dict.entries().rend(); ++entry)
+  }
+  for (auto entry = dict.entries().rbegin(); entry != dict.entries().rend(); ++entry) {
     reversed.set(entry->first, entry->second);
+  }
   EXPECT_EQ(same, dict);
   EXPECT_NE(reversed, dict);
 }
@@ -124,8 +127,9 @@ TEST(WorkQueueTest, DroppingTheLastHandleStillRunsQueuedWork) {
     gate.enter();
     // The first closure blocks until the handle is about to go, so the rest is still queued.
     queue.post([gate] { gate.wait(); });
-    for (int i = 0; i < 100; ++i)
+    for (int i = 0; i < 100; ++i) {
       queue.post([&] { ran.fetch_add(1); });
+    }
     gate.leave();
   }
   // Dropping the last handle on another thread waited for the queue to drain.
@@ -137,8 +141,9 @@ TEST(WorkQueueTest, DroppingTheLastHandleStillRunsQueuedWork) {
     auto holder = std::make_shared<std::optional<WorkQueue>>(WorkQueue::create("test.self"));
     WorkQueue queue = **holder;
     queue.post([holder] { holder->reset(); });  // drops the last handle on the queue itself
-    for (int i = 0; i < 10; ++i)
+    for (int i = 0; i < 10; ++i) {
       queue.post([&] { ran.fetch_add(1); });
+    }
     queue.post([done] { done.leave(); });
   }
   ASSERT_TRUE(done.waitFor(10s));

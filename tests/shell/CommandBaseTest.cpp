@@ -73,8 +73,8 @@ TEST(CommandModelTest, PathsComeFromTheParentAtInitAndChildrenMayOutliveIt) {
 // unless given a new one; aliases reach the child but are not sub-commands of their own.
 TEST(CommandModelTest, RegistrationAndLookupRules) {
   std::vector<std::string> ran;
-  const auto recorder = [&ran](std::string tag) {
-    return [&ran, tag](TaskGroup, std::vector<std::string>) {
+  const auto recorder = [&ran](const std::string& tag) {
+    return [&ran, tag](TaskGroup, const std::vector<std::string>&) {
       ran.push_back(tag);
       return true;
     };
@@ -121,7 +121,7 @@ TEST(CommandModelTest, RunOptionWaitsForEveryLeaveAndKeepsTheHandlersResult) {
     };
     command->addOption(
         "async",
-        [&](TaskGroup group, std::vector<std::string>) {
+        [&](TaskGroup group, const std::vector<std::string>&) {
           group.enter();
           group.enter();
           queue.post([=, done = returning.get_future().share()] {

@@ -31,8 +31,9 @@ std::string call(const PrivateBus& bus, const std::string& words) {
   std::istringstream in(words);
   for (std::string word; in >> word;) {
     args.push_back(word);
-    if (args.size() == 3)
+    if (args.size() == 3) {
       args.insert(args.end(), {"/org/halvex/" + word, "org.halvex." + word + "1"});
+    }
   }
   args[2] = "org.halvex." + args[2];
   const RunResult run = bus.busctl(args);
@@ -111,8 +112,9 @@ TEST(SimBus, AnswersAsTheScenarioSays) {
 std::vector<std::string> members(const std::string& xml, const std::string& interface) {
   const std::string text = std::regex_replace(xml, std::regex("<!--[^]*?-->"), "");
   const std::size_t begin = text.find("<interface name=\"" + interface + "\"");
-  if (begin == std::string::npos)
+  if (begin == std::string::npos) {
     return {};
+  }
   const std::string body = text.substr(begin, text.find("</interface>", begin) - begin);
   const std::regex tag(R"(<(\w+)([^>]*)>)"), attribute(R"re(\w+="[^"]*")re");
   std::vector<std::string> tags;
@@ -122,8 +124,9 @@ std::vector<std::string> members(const std::string& xml, const std::string& inte
         std::sregex_token_iterator(attributes.begin(), attributes.end(), attribute), {});
     std::sort(sorted.begin(), sorted.end());
     std::string line = (*t)[1];
-    for (const std::string& a : sorted)
+    for (const std::string& a : sorted) {
       line += " " + a;
+    }
     tags.push_back(line);
   }
   return tags;
@@ -165,8 +168,9 @@ TEST(SimBus, LogRootHoldsWhatTheToolWouldPrint) {
   call(bus, kHelperStatus + "0");
   // Each set where the tool says, and nothing else, not even what a package was made from.
   std::set<std::string> sets;
-  for (const auto& entry : fs::directory_iterator(snapshot))
+  for (const auto& entry : fs::directory_iterator(snapshot)) {
     sets.insert(entry.path().filename());
+  }
   EXPECT_EQ(sets,
             (std::set<std::string>{"log-bb-H1-bb-trace", "log-bb-T1-bb-trace", "log-bb-T1-coredump",
                                    "log-bb-T1-tel", "log-bb-T1.tar.gz"}));

@@ -21,8 +21,9 @@ namespace fs = std::filesystem;
 
 std::string repeat(const std::string& text, int times) {
   std::string out;
-  while (times-- > 0)
+  while (times-- > 0) {
     out += text;
+  }
   return out;
 }
 
@@ -54,7 +55,7 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
       {R"({"server": {"commands": {"TraceDumpState": {"result": 4294967296}}}})",
        "/server/commands/TraceDumpState/result", "out of range"},
       {R"({"server": {"commands": {"X": {"reply": "text"}}}})", "/server/commands/X/reply",
-       "\"text\" is not one of \"dict\""},
+       R"("text" is not one of "dict")"},
       {R"({"server": {"commands": {"a/b~c": {"bogus": 1}}}})", "/server/commands/a~1b~0c/bogus",
        "unknown key"},
       {R"({"server": {"commands": {"GetTraceProperty": {}}}})", "/server/commands/GetTraceProperty",
@@ -78,8 +79,9 @@ TEST(Scenario, ErrorsNameThePlaceAndTheProblem) {
 TEST(Scenario, EveryExampleScenarioIsValid) {
   int count = 0;
   for (const auto& entry : std::filesystem::directory_iterator(HALVEX_SCENARIO_DIR)) {
-    if (entry.path().extension() != ".json")
+    if (entry.path().extension() != ".json") {
       continue;
+    }
     ++count;
     EXPECT_NO_THROW(loadScenario(entry.path().string())) << entry.path();
   }

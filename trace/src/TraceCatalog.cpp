@@ -93,7 +93,7 @@ bool isAllowed() {
   return allowed;
 }
 
-bool isSupported(std::string name) {
+bool isSupported(std::string name) {  // NOLINT(performance-unnecessary-value-param)
   for (const Rule& rule : kRules) {
     if (equalIgnoringAsciiCase(name.c_str(), rule.name)) {
       return rule.supported();

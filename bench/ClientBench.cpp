@@ -17,8 +17,8 @@
 
 #include "platform/RunLoop.h"
 #include "platform/ServerClient.h"
+#include "platform/linux/BusProtocol.h"
 #include "platform/linux/MessageCodec.h"
-#include "platform/linux/detail/BusSupport.h"
 
 namespace {
 
@@ -48,18 +48,20 @@ void BM_BareCall(benchmark::State& state) {
     sd_bus_message* reply = nullptr;
     sd_bus_error error = SD_BUS_ERROR_NULL;
     int r = sd_bus_message_new_method_call(bus, &call, bus::kServerName, bus::kServerPath,
-                                           bus::kServerInterface, "PerformCommand");
+                                           bus::kServerInterface, bus::kServerPerformCommand);
     r = r < 0 ? r : sd_bus_message_append(call, "ss", "bench", kCommand);
     r = r < 0 ? r : bus::appendDict(call, request);
     r = r < 0 ? r : sd_bus_call(bus, call, 0, &error, &reply);
+    std::int32_t code = -1;
+    const char* message = nullptr;
     MessageValue value;
-    Result result =
-        r < 0 ? bus::makeResult(kResultBusError, "call failed") : bus::readOutcome(reply, value);
+    r = r < 0 ? r : sd_bus_message_read(reply, "is", &code, &message);
+    r = r < 0 ? r : bus::readVariant(reply, value);
     sd_bus_error_free(&error);
     sd_bus_message_unref(reply);
     sd_bus_message_unref(call);
-    if (!result.ok()) {
-      state.SkipWithError(result.message.c_str());
+    if (r < 0 || code != 0) {
+      state.SkipWithError("the bare call failed");
       break;
     }
     benchmark::DoNotOptimize(value);

@@ -13,7 +13,6 @@
 
 #include "platform/ServerProtocol.h"
 #include "platform/linux/MessageCodec.h"
-#include "platform/linux/detail/BusString.h"
 #include "sim/JsonDocument.h"
 
 namespace halvex::sim {

@@ -1,68 +1,116 @@
 // SPDX-License-Identifier: MIT
-// Device queries on a Linux host: the identity comes from org.halvex.Device over the system bus,
-// processes from /proc.
-//
-// A device's radio, vendor, product and build types do not change while a process runs, so the
-// identity is asked once and kept. Only an answer is kept: when no device service runs, or the
-// question fails, it is asked again next time, so a passing fault never reads as "no baseband"
-// for the rest of the process.
-#include <dirent.h>
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <cerrno>
+// The device identity on a Linux host: org.halvex.Device's GetIdentity over the system bus, kept
+// between questions for as long as nothing says it may have changed (platform/DeviceQueries.h
+// says when that is). The process check is in ProcessCheckLinux.cpp.
+#include <atomic>
 #include <cstdint>
 #include <limits>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
-#include <string_view>
 
+#include "detail/BusSupport.h"
+#include "detail/CallBounds.h"
+#include "detail/ProcessBus.h"
 #include "platform/DeviceQueries.h"
 #include "platform/linux/MessageCodec.h"
-#include "platform/linux/detail/BusSupport.h"
-#include "platform/linux/detail/CallBounds.h"
-#include "platform/linux/detail/ProcessBus.h"
 
 namespace halvex::device {
 
 namespace {
 
-// The kernel keeps a process's name (comm) in 16 bytes including the terminator.
-constexpr std::size_t kCommLength = 15;
-// Longest process name worth looking for; argv[0] is read no further than this.
-constexpr std::size_t kMaxProcessName = 4096;
+using bus::ProcessBus;
 
-MessageDict fetchIdentity() {
-  // Held across the first query, so that concurrent first callers make one query between them.
-  static std::mutex mutex;
-  static std::optional<MessageDict> kept;
-  std::lock_guard lock(mutex);
-  if (kept) {
-    return *kept;
+class IdentityCache;
+const std::shared_ptr<IdentityCache>& identityCache();
+
+class IdentityCache final : public bus::ConnectionListener {
+ public:
+  MessageDict get() {
+    ProcessBus& processBus = ProcessBus::instance();
+    // With no loop reading the connection, a change signalled already may still wait in it.
+    processBus.catchUp();
+    // Held across the question, so that concurrent first callers make one between them.
+    std::lock_guard lock(mutex_);
+    // Read before asking: a change signalled while the question is out makes the next one ask
+    // again.
+    const std::uint64_t generation = generation_.load();
+    if (kept_ && keptGeneration_ == generation) {
+      return *kept_;
+    }
+    MessageDict identity;
+    const Result result = processBus.call(
+        {bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, bus::kDeviceGetIdentity,
+         bus::callBounds().identity, "device", bus::kDeviceGetIdentity},
+        [this](sd_bus_message*) {
+          watch();
+          return 0;
+        },
+        [&identity](sd_bus_message* reply) {
+          if (sd_bus_message_has_signature(reply, "a{sv}") <= 0 ||
+              bus::readDict(reply, identity) < 0) {
+            identity = {};
+            return bus::makeResult(kResultBadReply, "identity of the wrong shape");
+          }
+          return Result{};
+        });
+    // Only an answer is kept, so that a passing fault never reads as "no baseband" for good.
+    kept_.reset();
+    if (result.ok()) {
+      kept_ = identity;
+      keptGeneration_ = generation;
+    }
+    return identity;
   }
-  MessageDict identity;
-  // A connection that went stale while nobody served it is replaced by the bus itself when the
-  // question cannot be sent on it.
-  const Result result = bus::ProcessBus::instance().call(
-      {bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, "GetIdentity",
-       bus::callBounds().identity, "device", "GetIdentity"},
-      nullptr, [&identity](sd_bus_message* reply) {
-        if (sd_bus_message_has_signature(reply, "a{sv}") <= 0 ||
-            bus::readDict(reply, identity) < 0) {
-          identity = {};
-          return bus::makeResult(kResultBadReply, "identity of the wrong shape");
-        }
-        return Result{};
-      });
-  if (result.ok()) {
-    kept = identity;
+
+  void connected(sd_bus*) override {}
+  // Whatever happened while we were away is unknown.
+  void disconnected() override { forget(); }
+
+ private:
+  void forget() { generation_.fetch_add(1); }
+
+  // In the I/O context, right before the question goes out: the bus handles our messages in
+  // order, so no change after the answer can slip by unseen.
+  void watch() {
+    ProcessBus& processBus = ProcessBus::instance();
+    if (watchedEpoch_ == processBus.epoch()) {
+      return;
+    }
+    if (watchedEpoch_ == 0) {
+      processBus.addListener(identityCache());
+    }
+    watchedEpoch_ = processBus.epoch();
+    // Never destroyed: the loop may still use them while the process exits.
+    static const auto* const changedRule = new std::string(bus::signalRule(
+        bus::kDeviceName, bus::kDevicePath, bus::kDeviceInterface, bus::kDeviceIdentityChanged));
+    static const auto* const ownerRule = new std::string(bus::ownerChangedRule(bus::kDeviceName));
+    processBus.addMatch(this, changedRule->c_str(), &IdentityCache::onChange, this);
+    processBus.addMatch(this, ownerRule->c_str(), &IdentityCache::onChange, this);
   }
-  return identity;
+
+  static int onChange(sd_bus_message*, void* userdata, sd_bus_error*) {
+    static_cast<IdentityCache*>(userdata)->forget();
+    return 0;
+  }
+
+  std::mutex mutex_;
+  std::optional<MessageDict> kept_;   // mutex_
+  std::uint64_t keptGeneration_ = 0;  // mutex_
+  std::atomic<std::uint64_t> generation_{1};
+  std::uint64_t watchedEpoch_ = 0;  // I/O context
+};
+
+const std::shared_ptr<IdentityCache>& identityCache() {
+  // Never destroyed: the connection's matches point at it until the process ends.
+  static const auto* const cache =
+      new std::shared_ptr<IdentityCache>(std::make_shared<IdentityCache>());
+  return *cache;
 }
 
 int identityNumber(const char* key) {
-  const MessageDict identity = fetchIdentity();
+  const MessageDict identity = identityCache()->get();
   const MessageValue* value = identity.get(key);
   const std::int64_t* number = value ? value->asInt64() : nullptr;
   if (number == nullptr || *number < std::numeric_limits<int>::min() ||
@@ -73,139 +121,40 @@ int identityNumber(const char* key) {
 }
 
 bool identityFlag(const char* key) {
-  const MessageDict identity = fetchIdentity();
+  const MessageDict identity = identityCache()->get();
   const MessageValue* value = identity.get(key);
   const bool* flag = value ? value->asBool() : nullptr;
   return flag != nullptr && *flag;
 }
 
-// The first field of a small file under /proc (procFd), at most kMaxProcessName + 1 bytes of it,
-// or nothing when the process is gone. Plain reads relative to the open directory: a scan opens
-// one of these per process on the host.
-bool readFirstField(int procFd, const std::string& path, char terminator, std::string& out) {
-  const int fd = openat(procFd, path.c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) {
-    return false;
-  }
-  out.clear();
-  char buffer[512];
-  bool done = false;
-  while (!done && out.size() <= kMaxProcessName) {
-    const ssize_t n = read(fd, buffer, sizeof buffer);
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n <= 0) {
-      break;
-    }
-    std::string_view chunk(buffer, static_cast<std::size_t>(n));
-    const std::size_t end = chunk.find(terminator);
-    done = end != std::string_view::npos;
-    out.append(chunk.substr(0, done ? end : chunk.size()));
-  }
-  close(fd);
-  if (out.size() > kMaxProcessName + 1) {
-    out.resize(kMaxProcessName + 1);
-  }
-  return true;
-}
-
-std::string_view baseName(std::string_view path) {
-  std::size_t slash = path.rfind('/');
-  return slash == std::string_view::npos ? path : path.substr(slash + 1);
-}
-
-// A process that has ended but is not yet reaped keeps its name; it is not running. Its state
-// follows the name in stat, after the last ")" since the name may hold one itself.
-bool hasEnded(int procFd, const std::string& pid) {
-  std::string stat;
-  if (!readFirstField(procFd, pid + "/stat", '\n', stat)) {
-    return true;
-  }
-  const std::size_t close = stat.rfind(')');
-  if (close == std::string::npos || close + 2 >= stat.size()) {
-    return false;
-  }
-  const char state = stat[close + 2];
-  return state == 'Z' || state == 'X';
-}
-
-bool processHasName(int procFd, const std::string& pid, const std::string& name) {
-  std::string comm;
-  if (!readFirstField(procFd, pid + "/comm", '\n', comm)) {
-    return false;
-  }
-  if (name.size() < kCommLength) {
-    return comm == name && !hasEnded(procFd, pid);
-  }
-  // comm holds only the first 15 bytes; a name that long is confirmed through argv[0], which the
-  // program was started under (the link's name when started through a symbolic link). An ended
-  // process has no argv left.
-  if (comm != std::string_view(name).substr(0, kCommLength)) {
-    return false;
-  }
-  std::string argv0;
-  return readFirstField(procFd, pid + "/cmdline", '\0', argv0) && baseName(argv0) == name;
-}
-
 }  // namespace
 
 int getRadioType() {
-  return identityNumber("RadioType");
+  return identityNumber(bus::kIdentityRadioType);
 }
 
 int getRadioVendor() {
-  return identityNumber("RadioVendor");
+  return identityNumber(bus::kIdentityRadioVendor);
 }
 
 int getProductType() {
-  return identityNumber("ProductType");
+  return identityNumber(bus::kIdentityProductType);
 }
 
 bool isInternalBuild() {
-  return identityFlag("InternalBuild");
+  return identityFlag(bus::kIdentityInternalBuild);
 }
 
 bool isCarrierBuild() {
-  return identityFlag("CarrierBuild");
+  return identityFlag(bus::kIdentityCarrierBuild);
 }
 
 bool isVendorBuild() {
-  return identityFlag("VendorBuild");
+  return identityFlag(bus::kIdentityVendorBuild);
 }
 
 bool isTraceAllowed() {
-  return identityFlag("TraceAllowed");
-}
-
-bool isProcessRunning(const std::string& name) {
-  if (name.empty() || name.size() > kMaxProcessName ||
-      name.find_first_of(std::string_view("/\0\n", 3)) != std::string::npos) {
-    return false;
-  }
-  DIR* proc = opendir("/proc");
-  if (proc == nullptr) {
-    return false;
-  }
-  bool found = false;
-  while (!found) {
-    errno = 0;
-    const dirent* entry = readdir(proc);
-    if (entry == nullptr) {
-      break;
-    }
-    std::string_view pid(entry->d_name);
-    if (pid.empty() || pid.find_first_not_of("0123456789") != std::string_view::npos) {
-      continue;
-    }
-    found = processHasName(dirfd(proc), std::string(pid), name);
-  }
-  closedir(proc);
-  return found;
-}
-
-std::string getProgramName() {
-  return program_invocation_short_name;
+  return identityFlag(bus::kIdentityTraceAllowed);
 }
 
 }  // namespace halvex::device

@@ -4,11 +4,11 @@
 #include <string>
 #include <string_view>
 
+#include "detail/BusSupport.h"
+#include "detail/CallBounds.h"
+#include "detail/ProcessBus.h"
 #include "platform/HelperClient.h"
 #include "platform/linux/MessageCodec.h"
-#include "platform/linux/detail/BusSupport.h"
-#include "platform/linux/detail/CallBounds.h"
-#include "platform/linux/detail/ProcessBus.h"
 
 namespace halvex {
 
@@ -45,8 +45,9 @@ class LinuxHelperClient final : public HelperClient {
     }
     MessageValue value;
     const Result result = bus::ProcessBus::instance().call(
-        {bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, "Perform",
-         bus::callBounds().helper, "helper", "Perform " + service_ + " " + command},
+        {bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, bus::kHelperPerform,
+         bus::callBounds().helper, "helper",
+         std::string(bus::kHelperPerform) + " " + service_ + " " + command},
         [&](sd_bus_message* message) {
           int r = sd_bus_message_append(message, "sis", service_.c_str(),
                                         static_cast<std::int32_t>(task), command);

@@ -7,8 +7,6 @@
 #include <string>
 #include <string_view>
 
-#include "platform/linux/detail/BusString.h"
-
 namespace halvex::bus {
 
 namespace {

@@ -12,6 +12,7 @@
 #include <systemd/sd-bus.h>
 
 #include <cstddef>
+#include <string_view>
 
 #include "platform/MessageDict.h"
 
@@ -25,6 +26,11 @@ inline constexpr int kMaxDictDepth = 16;
 // make us spend unbounded time or memory on one message; MessageDict's set is linear in its size.
 inline constexpr std::size_t kMaxDictEntries = 1024;
 inline constexpr std::size_t kMaxValues = 16384;
+
+// True when text can travel as a D-Bus string unchanged: valid UTF-8 (no overlong forms, no
+// surrogates, no noncharacters, as sd-bus checks it) without a NUL byte. sd-bus takes C strings,
+// so a NUL would silently cut the value.
+bool isBusString(std::string_view text);
 
 // Appends dict as "a{sv}". A string value the bus cannot carry (not UTF-8, a NUL byte, a
 // noncharacter) is sent as null instead, so a request is never lost to one bad value. Returns 0,

@@ -13,9 +13,11 @@
 #include <optional>
 #include <thread>
 
+#include "detail/ProcessBus.h"
 #include "platform/ServerClient.h"
 #include "platform/ServerProtocol.h"
 #include "platform/linux/testing/BusTesting.h"
+#include "tests/platform_linux/Descriptors.h"
 #include "tests/support/TestBus.h"
 
 namespace halvex::test {
@@ -37,9 +39,10 @@ class ManagerTest : public ::testing::Test {
  protected:
   // Starts the simulator, the run loop, the queue and the manager.
   // Anything that changes the environment must come before: this is where threads start.
-  void start(const std::string& scenario) {
+  void start(const std::string& scenario, bool withLoop = true) {
     sim_.emplace(bus_, scenario);
-    loop_.emplace();
+    if (withLoop)
+      loop_.emplace();
     queue_.emplace(WorkQueue::create("test.queue"));
     manager_ = client::CreateManager("halvextool", *queue_);
   }
@@ -174,13 +177,43 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
   EXPECT_EQ(mail("nested")[0].result.code, 0);
   EXPECT_EQ(mail("hang")[0].result.code, kResultTimeout);
   EXPECT_EQ(mail("unsendable")[0].result.code, kResultInvalidRequest);
+}
 
-  // A stopped loop hands the bus back: callers use it directly, and a new loop claims it again.
-  for (int i = 0; i < 2; ++i) {
-    loop_.reset();
-    EXPECT_EQ(client::PerformCommand(manager_, kCommandTraceDumpState, {}, reply).code, 0);
-    loop_.emplace();
+// Whatever becomes of the run loop (never started, could not start, or stopped with requests
+// out), every request ends once, on the queue, with its outcome, within its bound: callers then
+// serve the connection themselves. A loop started later claims it again.
+TEST_F(ManagerTest, EveryRequestEndsWhateverBecomesOfTheLoop) {
+  bus::CallBounds bounds = bus::callBounds();
+  bounds.otherCommand = std::chrono::milliseconds(300);
+  bus::ScopedCallBoundsForTesting shorter(bounds);
+  start(R"({"server": {"commands": {"Hang": {"fault": "never_answer"}}}})", false);
+  for (const std::string fate : {"never started", "could not start", "stopped"}) {
+    SCOPED_TRACE(fate);
+    if (fate == "could not start") {
+      NoMoreDescriptors exhausted;
+      EXPECT_LT(bus::ProcessBus::instance().run(), 0);
+    } else if (fate == "stopped") {
+      loop_.emplace();
+      client::PerformCommand(manager_, "Hang", record(fate), {});
+      ASSERT_TRUE(barrier());
+      loop_.reset();
+      ASSERT_TRUE(waitFor(1, fate));
+      EXPECT_EQ(mail(fate)[0].result.code, kResultConnectionLost);
+    }
+    client::PerformCommand(manager_, kCommandTraceDumpState, record(fate + " dump"), {});
+    client::PerformCommand(manager_, "Hang", record(fate + " hang"), {});
+    MessageValue reply;
+    EXPECT_EQ(client::PerformCommand(manager_, "Hang", {}, reply).code, kResultTimeout);
+    ASSERT_TRUE(waitFor(1, fate + " dump") && waitFor(1, fate + " hang") && drain());
+    EXPECT_EQ(mail(fate + " dump")[0].result.code, 0);
+    EXPECT_EQ(mail(fate + " hang")[0].result.code, kResultTimeout);
   }
+  loop_.emplace();
+  EXPECT_TRUE(barrier());
+  ASSERT_TRUE(drain());
+  EXPECT_EQ(mail().size(), 7u);
+  for (const Delivery& done : mail())
+    EXPECT_EQ(done.onQueue, true) << done.name;
 }
 
 // A server of our own, on its own thread: commands get the bus driver's error for an absent

@@ -1,12 +1,11 @@
 // SPDX-License-Identifier: MIT
-#include "platform/linux/detail/BusSupport.h"
+#include "detail/BusSupport.h"
 
 #include <cerrno>
 #include <cstring>
 #include <ctime>
 
 #include "platform/linux/MessageCodec.h"
-#include "platform/linux/detail/BusString.h"
 
 namespace halvex::bus {
 
@@ -93,6 +92,20 @@ Result resultFromErrorReply(sd_bus* bus, sd_bus_message* reply) {
 Result resultFromOpenFailure(int r) {
   return makeResult(kResultServerNotRunning,
                     std::string("no system bus: ") + std::strerror(r < 0 ? -r : r));
+}
+
+std::string ownerChangedRule(const char* name) {
+  return std::string("type='signal',sender='") + kBusDriverName + "',path='" + kBusDriverPath +
+         "',interface='" + kBusDriverInterface + "',member='NameOwnerChanged',arg0='" + name + "'";
+}
+
+std::string signalRule(const char* sender, const char* path, const char* interface,
+                       const char* member) {
+  std::string rule = "type='signal',";
+  if (sender != nullptr) {
+    rule = rule + "sender='" + sender + "',";
+  }
+  return rule + "path='" + path + "',interface='" + interface + "',member='" + member + "'";
 }
 
 Result readOutcome(sd_bus_message* reply, MessageValue& value) {

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: MIT
-// What every service of the host backend needs on the bus: the names of the protocol and the
-// mapping of bus failures to Result codes. Nothing here keeps state between calls.
+// What every service of the host backend needs on the bus: the mapping of bus failures to Result
+// codes, and the checks and bounds of what goes out. Nothing here keeps state between calls.
 #pragma once
 
 #include <systemd/sd-bus.h>
@@ -12,24 +12,12 @@
 #include <string>
 #include <string_view>
 
+#include "detail/Private.h"
 #include "platform/MessageDict.h"
 #include "platform/Result.h"
+#include "platform/linux/BusProtocol.h"
 
 namespace halvex::bus {
-
-inline constexpr char kServerName[] = "org.halvex.Server";
-inline constexpr char kServerPath[] = "/org/halvex/Server";
-inline constexpr char kServerInterface[] = "org.halvex.Server1";
-inline constexpr char kHelperName[] = "org.halvex.Helper";
-inline constexpr char kHelperPath[] = "/org/halvex/Helper";
-inline constexpr char kHelperInterface[] = "org.halvex.Helper1";
-inline constexpr char kDeviceName[] = "org.halvex.Device";
-inline constexpr char kDevicePath[] = "/org/halvex/Device";
-inline constexpr char kDeviceInterface[] = "org.halvex.Device1";
-
-inline constexpr char kBusDriverName[] = "org.freedesktop.DBus";
-inline constexpr char kBusDriverPath[] = "/org/freedesktop/DBus";
-inline constexpr char kBusDriverInterface[] = "org.freedesktop.DBus";
 
 // Where the platform's own entries in the system log come from.
 inline constexpr char kLogSubsystem[] = "org.halvex.platform";
@@ -67,6 +55,12 @@ Result resultFromErrorReply(sd_bus* bus, sd_bus_message* reply);
 
 // The outcome when sd_bus_open_system itself failed with r: there is no bus to reach anyone on.
 Result resultFromOpenFailure(int r);
+
+// Match rules: the bus driver's NameOwnerChanged for name, and a signal at path from sender (a
+// name the bus resolves to its owner when the signal comes; null: from anyone).
+std::string ownerChangedRule(const char* name);
+std::string signalRule(const char* sender, const char* path, const char* interface,
+                       const char* member);
 
 // Reads a method reply "isv" (code, message, reply) into the outcome and value, whatever the
 // code: a caller that needs success checks it. Anything but "isv", or a value outside the

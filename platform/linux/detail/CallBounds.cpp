@@ -1,5 +1,5 @@
 // SPDX-License-Identifier: MIT
-#include "platform/linux/detail/CallBounds.h"
+#include "detail/CallBounds.h"
 
 #include "platform/ServerProtocol.h"
 

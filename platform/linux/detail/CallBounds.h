@@ -7,6 +7,8 @@
 #include <chrono>
 #include <string_view>
 
+#include "detail/Private.h"
+
 namespace halvex::bus {
 
 struct CallBounds {

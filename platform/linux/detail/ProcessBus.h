@@ -3,39 +3,38 @@
 //
 // Every service of the host backend (the client managers, the helper clients, the device
 // queries) shares this connection: opening one costs authentication and Hello, which a one-shot
-// tool would otherwise pay once per service.
+// tool would otherwise pay once per service. Who may touch it when, and how requests from other
+// threads reach it, is the hand-over's business (HandOver.h); the calls out and their deadlines
+// are the table's (PendingCalls.h).
 //
-// sd-bus objects are not thread-safe, so exactly one context touches the connection at a time:
-// the I/O context, and it holds the bus's lock. Until some thread calls run(), that is whichever
-// thread takes the lock: work posted then runs at once on the posting thread, and a synchronous
-// call pumps the connection itself (the tool's start-up checks run this way, before main enters
-// the loop). From run() on, it is the loop's thread, which lets go of the lock only while it
-// sleeps in epoll: other threads queue closures for it, except that a request may be sent by its
-// caller meanwhile (send(), call()), sparing two thread hand-offs; its reply still comes through
-// the loop. Nothing but the loop's thread ever touches the sd-event loop.
-//
-// Calls carry their own time-outs (CallBounds.h) and are logged to the system log with their
-// outcome and duration; sd-bus's default time-out, which the environment can change, plays no
-// part. Every call completes exactly once.
+// Every request ends exactly once, with its outcome, within its bound (CallBounds.h), whatever
+// becomes of the loop:
+//   - a loop serves the connection: the loop reads the answer, or completes the request when its
+//     deadline passes;
+//   - no loop does (none was started, it could not start, or it stopped): the caller that sends
+//     a request serves the connection itself until the request has completed, so request() then
+//     returns only after done has run;
+//   - the loop stops: requests still out, and those queued for it, complete with
+//     kResultConnectionLost before run() returns; later ones are served directly.
+// sd-bus's own time-out, which the environment can change, plays no part. Each request is
+// logged to the system log with its outcome and duration, written outside every lock.
 #pragma once
 
 #include <systemd/sd-bus.h>
 #include <systemd/sd-event.h>
 
-#include <atomic>
 #include <chrono>
 #include <cstdint>
-#include <deque>
 #include <functional>
-#include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "detail/BusSupport.h"
+#include "detail/HandOver.h"
+#include "detail/PendingCalls.h"
+#include "detail/Private.h"
 #include "platform/Result.h"
-#include "platform/SystemLog.h"
-#include "platform/linux/detail/BusSupport.h"
 
 namespace halvex::bus {
 
@@ -54,50 +53,61 @@ struct CallPlan {
 class ConnectionListener {
  public:
   virtual ~ConnectionListener() = default;
-  // A new connection was opened (install matches here).
+  // A new connection was opened.
   virtual void connected(sd_bus* bus) = 0;
-  // The connection broke or was closed; its pending calls have already completed.
+  // The connection broke or was closed; its pending calls have completed and its matches are
+  // gone.
   virtual void disconnected() = 0;
 };
 
-class ProcessBus {
+class Wakeup;
+
+class ProcessBus final : private HandOver::Keeper {
  public:
-  using Task = std::function<void()>;
-  // Exactly one of the two carries the outcome: reply is a method return (valid only during the
-  // call) and failure is success; or reply is null and failure says what went wrong.
-  // It returns the outcome the caller made of it, which is what the log records.
-  using ReplyHandler = std::function<Result(const Result& failure, sd_bus_message* reply)>;
+  using Task = HandOver::Task;
+  using ReplyHandler = PendingCalls::ReplyHandler;
   // Turns a method return into the caller's values, in the I/O context.
   using Decoder = std::function<Result(sd_bus_message* reply)>;
 
-  // The one instance. It is never destroyed: the process may exit while the loop still runs.
+  // The one instance. It is never destroyed: the process may exit while the loop still runs. At
+  // exit, log entries still waiting are written.
   static ProcessBus& instance();
 
   ProcessBus(const ProcessBus&) = delete;
   ProcessBus& operator=(const ProcessBus&) = delete;
 
   // Serves the connection on this thread until stop(). Returns a negative errno when the loop
-  // could not run or failed, 0 after stop(). When it returns, every pending call has completed
-  // with kResultConnectionLost, the connection is closed, and the bus is back where it was
-  // before run(): a later run() may claim it again. claimed, when given, runs once the loop has
-  // claimed the bus (work posted from then on runs on this thread), before it serves anything.
+  // could not start (-EBUSY: another thread runs one) or failed, 0 after stop(). When it
+  // returns, every request it had taken has completed, the connection is closed, and callers
+  // serve their requests directly again; a later run() may claim the connection anew. claimed,
+  // when given, runs once the loop has claimed the connection, before it serves anything.
   int run(const std::function<void()>& claimed = {});
 
   // Any thread: makes run() return. A no-op when no loop runs.
   void stop();
 
-  // Any thread but the loop's: runs task in the I/O context, at once while no loop runs, else on
-  // the loop's thread in the order posted.
+  // Any thread: runs task in the I/O context (see HandOver::post), at once when this thread is
+  // the I/O context already.
   void post(Task task);
 
-  // Any thread but the loop's: runs task in the I/O context, on this thread when the loop sleeps
-  // and the connection is open (the task may then only send calls on it), else as post() does.
-  // For the hot path of sending a request: no hand-off when the loop has nothing else to do.
-  void send(Task task);
+  // Any thread: sends the call, auto-start off. done runs exactly once with the outcome, in the
+  // I/O context, or on this thread when the request could not get there; from the I/O context
+  // it may run before request() returns, and with no loop it always has. owner tags the call
+  // for cancel(); it may be null.
+  void request(CallPlan plan, MessageBuilder build, ReplyHandler done, const void* owner);
 
-  // Any thread but the loop's: sends the call and blocks until it completes. decode runs on the
-  // method return in the I/O context; its Result is returned. Failures come back as Results.
-  Result call(const CallPlan& plan, const MessageBuilder& build, const Decoder& decode);
+  // Any thread but the I/O context: sends the call and blocks until it completes, sleeping.
+  // decode runs on the method return in the I/O context; its Result is returned. While the loop
+  // sleeps, the caller sends the call itself and reads the connection for its answer for a
+  // while (10 ms), masking the connection from the loop meanwhile: a quick answer then
+  // wakes no other thread. Whatever else arrives meanwhile is dispatched on the caller's thread,
+  // as the I/O context, and what only the loop may do is left to it.
+  Result call(CallPlan plan, MessageBuilder build, const Decoder& decode);
+
+  // Any thread but the loop's: when no loop serves the connection, reads and dispatches what has
+  // arrived without waiting, so that signals already sent are acted upon; with a loop, which
+  // reads as things arrive, nothing.
+  void catchUp();
 
   // --- I/O context only ---
 
@@ -109,19 +119,21 @@ class ProcessBus {
   // Counts connections opened, so that a late answer can tell whether it belongs to the current.
   std::uint64_t epoch() const { return epoch_; }
 
-  // Sends a call with auto-start off. done runs exactly once in the I/O context, possibly before
-  // callAsync returns. owner tags the call for cancel(); it may be null.
-  void callAsync(const CallPlan& plan, const MessageBuilder& build, ReplyHandler done,
-                 const void* owner = nullptr);
-
   // Completes owner's pending calls now with why.
   void cancel(const void* owner, const Result& why);
+
+  // Installs a match on the current connection for owner, without waiting for the bus to
+  // confirm it. It lasts until removeMatches(owner) or the connection goes. False when it could
+  // not be installed: the signals are then missed, but the connection stays.
+  bool addMatch(const void* owner, const char* rule, sd_bus_message_handler_t callback,
+                void* userdata);
+  void removeMatches(const void* owner);
 
   void addListener(const std::shared_ptr<ConnectionListener>& listener);
   void removeListener(const ConnectionListener* listener);
 
-  // Runs task once after delay (in the loop; a timer waits while no loop runs). Dropping the
-  // returned source, in the I/O context, cancels it.
+  // Runs task once after delay while the loop runs; null with no loop. Dropping the returned
+  // source, in the I/O context, cancels it.
   struct SourceReleaser {
     void operator()(sd_event_source* source) const { sd_event_source_disable_unref(source); }
   };
@@ -129,58 +141,66 @@ class ProcessBus {
   Timer runAfter(std::chrono::microseconds delay, Task task);
 
  private:
-  struct Pending;
+  struct Match {
+    const void* owner;
+    sd_bus_slot* slot;
+  };
 
   ProcessBus();
 
-  void setUpEvent();
-  void tearDownEvent();
-  // Queues task for the loop; false, leaving task alone, when no loop takes work.
-  bool enqueue(Task& task);
-  // Runs send on this thread as the I/O context while the loop sleeps; false when it cannot.
-  bool borrow(const Task& send);
-  void wake();
-  void drainInbox();
-  // Direct use: serves the connection on this thread until done is set.
-  void pumpUntil(const std::atomic<bool>& done);
+  // HandOver::Keeper
+  bool lendable() override;
+  bool wakeAfterLending() override;
+  void serveDirectly() override;
+  void flushLog() override;
+
+  int setUpLoop();
+  void tearDownLoop();
+  // Puts the connection in the loop's sight, or takes it out.
+  void attachBus();
+  void detachBus();
+  // A borrower's wait for its own answer, up to kAnswerHere.
+  void awaitAnswer(const Wakeup& answered);
+  // Reads and dispatches one message; drops the connection when it broke.
+  void dispatchBus();
+  // Completes a request that never got to the I/O context in time.
+  void finishLate(const CallPlan& plan, ReplyHandler done);
+  // Sends the call now. False, leaving done alone, when a borrower must leave it to the loop.
+  bool send(const CallPlan& plan, const MessageBuilder& build, ReplyHandler& done,
+            const void* owner);
   void dropConnection(const char* why);
-  void complete(std::unique_ptr<Pending> pending, const Result& failure, sd_bus_message* reply);
-  std::uint64_t earliestDeadline() const;
-  void expireDue(std::uint64_t now);
   void armExpiry(std::uint64_t deadline);
   std::vector<std::shared_ptr<ConnectionListener>> liveListeners();
 
   static int onWake(sd_event_source* source, int fd, std::uint32_t revents, void* userdata);
   static int onReply(sd_bus_message* reply, void* userdata, sd_bus_error* error);
   static int onExpiry(sd_event_source* source, std::uint64_t usec, void* userdata);
-  static int onFilter(sd_bus_message* message, void* userdata, sd_bus_error* error);
-  static int onDeferredDrop(sd_event_source* source, void* userdata);
+  static int onBusPrepare(sd_event_source* source, void* userdata);
+  static int onBusReady(sd_event_source* source, int fd, std::uint32_t revents, void* userdata);
+  static int onBusTimer(sd_event_source* source, std::uint64_t usec, void* userdata);
   static int onTimer(sd_event_source* source, std::uint64_t usec, void* userdata);
 
-  const std::shared_ptr<LogServer> log_;
+  LogOutbox log_;
+  HandOver handOver_;
 
-  // Held by whoever is the I/O context: the loop for all but its wait in epoll, a caller that
-  // borrows the connection meanwhile, or the direct user while no loop runs.
-  std::mutex ioMutex_;
-  bool claimed_ = false;  // a loop serves the bus (ioMutex_)
-
-  std::mutex inboxMutex_;
-  std::deque<Task> inbox_;
-  bool inboxOpen_ = false;  // a loop takes queued work (inboxMutex_)
-
-  // I/O context only, apart from the wake descriptor.
-  int wakeFd_ = -1;
-  sd_event* event_ = nullptr;
+  // I/O context only.
+  PendingCalls pending_;
+  sd_event* event_ = nullptr;  // while a loop runs
   sd_event_source* wakeSource_ = nullptr;
-  sd_event_source* dropSource_ = nullptr;
   sd_event_source* expirySource_ = nullptr;
+  // The loop sees the connection through an epoll set of our own, so that a borrower can take it
+  // out of the loop's sight without touching sd-event, which only the loop's thread may.
+  int busWatch_ = -1;
+  std::uint32_t busEvents_ = 0;  // what busWatch_ waits for on the connection now
+  sd_event_source* busSource_ = nullptr;
+  sd_event_source* busTimer_ = nullptr;  // sd-bus's own time-outs, and work already read
+  bool dispatching_ = false;             // a borrower dispatches while it waits for its answer
+  std::uint64_t armedDeadline_ = 0;      // 0: the expiry timer is off
+  bool rearmWanted_ = false;             // a borrower set an earlier deadline than the timer's
   sd_bus* bus_ = nullptr;
   bool closing_ = false;  // run() is ending: nothing opens a connection
   std::uint64_t epoch_ = 0;
-  std::uint64_t nextCallId_ = 0;
-  std::uint64_t armedDeadline_ = 0;  // 0: the expiry timer is off
-  bool rearmWanted_ = false;         // a borrower set an earlier deadline than the timer's
-  std::map<std::uint64_t, std::unique_ptr<Pending>> pending_;
+  std::vector<Match> matches_;
   std::vector<std::weak_ptr<ConnectionListener>> listeners_;
   Result lastOpenFailure_;
 };

@@ -3,7 +3,7 @@
 
 #include <future>
 
-#include "platform/linux/detail/ProcessBus.h"
+#include "detail/ProcessBus.h"
 
 namespace halvex::bus {
 

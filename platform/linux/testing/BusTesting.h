@@ -4,7 +4,7 @@
 
 #include <thread>
 
-#include "platform/linux/detail/CallBounds.h"
+#include "detail/CallBounds.h"
 
 namespace halvex::bus {
 

@@ -23,17 +23,21 @@ void TaskGroup::enter() const {
 }
 
 void TaskGroup::leave() const {
-  std::unique_lock lock(state_->mutex);
-  if (state_->count == 0) {
-    lock.unlock();
-    std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
-    std::abort();
+  // Kept alive past the unlock: a waiter that wakes may destroy the group at once, and this handle
+  // may be nothing but a reference to the waiter's own.
+  const std::shared_ptr<State> state = state_;
+  {
+    std::lock_guard lock(state->mutex);
+    if (state->count == 0) {
+      std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
+      std::abort();
+    }
+    if (--state->count != 0) {
+      return;
+    }
   }
-  // Under the lock: a waiter that wakes may destroy the group at once, and this handle may be
-  // nothing but a reference to the waiter's own.
-  if (--state_->count == 0) {
-    state_->drained.notify_all();
-  }
+  // After the unlock, so that the waiter does not wake into a lock still held.
+  state->drained.notify_all();
 }
 
 void TaskGroup::wait() const {

@@ -35,16 +35,17 @@ void LogOutbox::flush() {
     return;
   }
   std::lock_guard writer(writing_);
-  std::vector<LoggedOutcome> batch;
   {
+    // Swapped with the batch emptied last time, so that neither side allocates anew.
     std::lock_guard lock(mutex_);
-    batch.swap(entries_);
+    batch_.swap(entries_);
     waiting_.store(false, std::memory_order_relaxed);
   }
-  for (const LoggedOutcome& entry : batch) {
+  for (const LoggedOutcome& entry : batch_) {
     server_->write(LogContext(kLogSubsystem, entry.category),
                    entry.result.ok() ? LogLevel::kDebug : LogLevel::kWarning, entry.describe());
   }
+  batch_.clear();
 }
 
 PendingCalls::~PendingCalls() {

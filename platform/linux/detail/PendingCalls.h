@@ -52,6 +52,7 @@ class LogOutbox {
   const std::shared_ptr<LogServer> server_;
   std::atomic<bool> waiting_{false};  // a cheap look before the locks
   std::mutex writing_;                // one writer at a time, so entries never pass each other
+  std::vector<LoggedOutcome> batch_;  // writing_
   std::mutex mutex_;                  // entries_
   std::vector<LoggedOutcome> entries_;
 };

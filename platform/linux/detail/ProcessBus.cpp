@@ -96,8 +96,13 @@ Result ProcessBus::call(CallPlan plan, MessageBuilder build, const Decoder& deco
   // can do.
   const auto by = std::chrono::steady_clock::now() + plan.timeout;
   Task task = [&] {
-    if (send(plan, build, done, nullptr) && HandOver::borrowing()) {
+    // Masked before the call goes out, so that not even a quick answer wakes the loop.
+    const bool here = HandOver::borrowing() && maskBus(true);
+    if (send(plan, build, done, nullptr) && here) {
       awaitAnswer(outcome->done);
+    }
+    if (here) {
+      maskBus(false);
     }
   };
   if (!handOver_.send(std::move(task), by)) {
@@ -107,12 +112,14 @@ Result ProcessBus::call(CallPlan plan, MessageBuilder build, const Decoder& deco
   return std::move(outcome->result);
 }
 
+bool ProcessBus::maskBus(bool masked) {
+  epoll_event watched{};
+  watched.events = masked ? 0 : busEvents_;
+  return bus_ != nullptr && busWatch_ >= 0 &&
+         epoll_ctl(busWatch_, EPOLL_CTL_MOD, sd_bus_get_fd(bus_), &watched) == 0;
+}
+
 void ProcessBus::awaitAnswer(const Wakeup& answered) {
-  const int fd = sd_bus_get_fd(bus_);
-  epoll_event masked{};
-  if (busWatch_ < 0 || epoll_ctl(busWatch_, EPOLL_CTL_MOD, fd, &masked) < 0) {
-    return;
-  }
   dispatching_ = true;
   // The answer cannot be there yet: wait first, then read (sd_bus_wait returns at once when
   // something read earlier waits to be dispatched).
@@ -130,9 +137,6 @@ void ProcessBus::awaitAnswer(const Wakeup& answered) {
     }
   }
   dispatching_ = false;
-  epoll_event watched{};
-  watched.events = busEvents_;
-  epoll_ctl(busWatch_, EPOLL_CTL_MOD, fd, &watched);
 }
 
 void ProcessBus::catchUp() {

@@ -159,7 +159,9 @@ class ProcessBus final : private HandOver::Keeper {
   // Puts the connection in the loop's sight, or takes it out.
   void attachBus();
   void detachBus();
-  // A borrower's wait for its own answer, up to kAnswerHere.
+  // Takes the connection out of the loop's sight, or puts it back; false when it cannot.
+  bool maskBus(bool masked);
+  // A borrower's wait for its own answer, up to 10 ms, the connection masked.
   void awaitAnswer(const Wakeup& answered);
   // Reads and dispatches one message; drops the connection when it broke.
   void dispatchBus();

@@ -3,6 +3,7 @@
 // server object answers once the bus has done what it asked.
 #include "sim/ControlObject.h"
 
+#include <cerrno>
 #include <string>
 
 #include "platform/ServerProtocol.h"
@@ -15,6 +16,7 @@ constexpr ObjectNames kNames{"org.halvex.Simulator", "/org/halvex/Simulator",
                              "org.halvex.Simulator1", "control"};
 constexpr char kErrorNoState[] = "org.halvex.Simulator.Error.NoState";
 constexpr char kErrorServerAbsent[] = "org.halvex.Simulator.Error.ServerAbsent";
+constexpr char kErrorDeviceAbsent[] = "org.halvex.Simulator.Error.DeviceAbsent";
 
 }  // namespace
 
@@ -26,11 +28,16 @@ const sd_bus_vtable ControlObject::kVtable[] = {
                              &ControlObject::onEmitEvent, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("SetServerPresent", "b", SD_BUS_PARAM(present), "", "",
                              &ControlObject::onSetServerPresent, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("SetIdentity", "a{sv}", SD_BUS_PARAM(identity), "", "",
+                             &ControlObject::onSetIdentity, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD("Quit", "", "", &ControlObject::onQuit, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END};
 
-ControlObject::ControlObject(ServerObject& server, const Services& services)
-    : server_(server), services_(services), endpoint_(kNames, kVtable, this, services) {}
+ControlObject::ControlObject(ServerObject& server, DeviceObject& device, const Services& services)
+    : server_(server),
+      device_(device),
+      services_(services),
+      endpoint_(kNames, kVtable, this, services) {}
 
 int ControlObject::emit(sd_bus_message* call, sd_bus_error* error, const std::string& asked,
                         const char* name, const MessageValue& payload) {
@@ -81,6 +88,29 @@ int ControlObject::onSetServerPresent(sd_bus_message* call, void* userdata, sd_b
     }
     self->server_.setPresent(present != 0, keep(call), self->endpoint_.journal());
     return 1;
+  });
+}
+
+int ControlObject::onSetIdentity(sd_bus_message* call, void* userdata, sd_bus_error* error) {
+  return guarded(error, [&] {
+    auto* self = static_cast<ControlObject*>(userdata);
+    MessageDict changes;
+    if (bus::readDict(call, changes) < 0) {
+      return self->endpoint_.refuse(error, "SetIdentity", SD_BUS_ERROR_INVALID_ARGS,
+                                    "the identity holds a value outside the message types");
+    }
+    const std::string asked = "SetIdentity " + describe(MessageValue::dict(changes));
+    const int r = self->device_.change(changes);
+    if (r == -EINVAL) {
+      return self->endpoint_.refuse(error, asked, SD_BUS_ERROR_INVALID_ARGS,
+                                    "a key or a type that GetIdentity does not answer with");
+    }
+    if (r < 0) {
+      return self->endpoint_.refuse(error, asked, kErrorDeviceAbsent,
+                                    "the device is not on the bus");
+    }
+    self->endpoint_.journal().log(LogLevel::kInfo, asked + ": IdentityChanged sent");
+    return sd_bus_reply_method_return(call, "");
   });
 }
 

@@ -1,12 +1,14 @@
 // SPDX-License-Identifier: MIT
 // The simulator's control interface, org.halvex.Simulator1 at /org/halvex/Simulator, through
 // which tests steer a running simulator: EmitState and EmitEvent send the server's Event signal,
-// SetServerPresent takes the server off the bus or brings it back, and Quit ends the loop. Its
+// SetServerPresent takes the server off the bus or brings it back, SetIdentity changes the
+// device's identity, and Quit ends the loop. Its
 // connection is the first made and stays for the daemon's life. Runs on the daemon's loop.
 #pragma once
 
 #include <string>
 
+#include "sim/DeviceObject.h"
 #include "sim/Endpoint.h"
 #include "sim/ServerObject.h"
 
@@ -14,7 +16,7 @@ namespace halvex::sim {
 
 class ControlObject {
  public:
-  ControlObject(ServerObject& server, const Services& services);
+  ControlObject(ServerObject& server, DeviceObject& device, const Services& services);
   ControlObject(const ControlObject&) = delete;
   ControlObject& operator=(const ControlObject&) = delete;
 
@@ -24,6 +26,7 @@ class ControlObject {
   static int onEmitState(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static int onEmitEvent(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static int onSetServerPresent(sd_bus_message* call, void* userdata, sd_bus_error* error);
+  static int onSetIdentity(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static int onQuit(sd_bus_message* call, void* userdata, sd_bus_error* error);
   static const sd_bus_vtable kVtable[];
 
@@ -32,6 +35,7 @@ class ControlObject {
            const MessageValue& payload);
 
   ServerObject& server_;
+  DeviceObject& device_;
   const Services& services_;
   Endpoint endpoint_;
 };

@@ -69,7 +69,7 @@ struct Daemon::Impl {
   DeviceObject device;
   HelperObject helper;
   ServerObject server;
-  ControlObject control{server, services};
+  ControlObject control{server, device, services};
   std::vector<const Endpoint*> presentAtStart;
   bool readySent = false;
 };

@@ -8,21 +8,21 @@
 #include <utility>
 
 #include "platform/ServerProtocol.h"
+#include "platform/linux/BusProtocol.h"
 #include "sim/Replies.h"
 #include "sim/RequestLog.h"
 
 namespace halvex::sim {
 namespace {
 
-constexpr ObjectNames kNames{"org.halvex.Helper", "/org/halvex/Helper", "org.halvex.Helper1",
-                             "helper"};
+constexpr ObjectNames kNames{bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, "helper"};
 
 }  // namespace
 
 // Argument names are those of data/dbus/interfaces/*.xml, which a test holds equal to these.
 const sd_bus_vtable HelperObject::kVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD_WITH_NAMES("Perform", "sisa{sv}",
+    SD_BUS_METHOD_WITH_NAMES(bus::kHelperPerform, "sisa{sv}",
                              SD_BUS_PARAM(service) SD_BUS_PARAM(task) SD_BUS_PARAM(command)
                                  SD_BUS_PARAM(request),
                              "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
@@ -52,7 +52,7 @@ int HelperObject::onPerform(sd_bus_message* call, void* userdata, sd_bus_error* 
       return r;
     }
     self->services_.log.write({{"service", "helper"},
-                               {"method", "Perform"},
+                               {"method", bus::kHelperPerform},
                                {"client", service},
                                {"task", task},
                                {"command", command},

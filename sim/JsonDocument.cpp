@@ -195,20 +195,13 @@ std::string child(const std::string& pointer, std::string_view key) {
 
 const char* typeName(const Json& value) {
   switch (value.type()) {
-    case Json::value_t::null:
-      return "null";
-    case Json::value_t::boolean:
-      return "a boolean";
-    case Json::value_t::string:
-      return "a string";
-    case Json::value_t::array:
-      return "an array";
-    case Json::value_t::object:
-      return "an object";
-    case Json::value_t::number_float:
-      return "a fractional number";
-    default:
-      return "an integer";
+    case Json::value_t::null: return "null";
+    case Json::value_t::boolean: return "a boolean";
+    case Json::value_t::string: return "a string";
+    case Json::value_t::array: return "an array";
+    case Json::value_t::object: return "an object";
+    case Json::value_t::number_float: return "a fractional number";
+    default: return "an integer";
   }
 }
 

@@ -13,6 +13,8 @@
 #include <fstream>
 #include <vector>
 
+#include "halvex/trace/DiagConfig.h"
+#include "halvex/trace/LogLocations.h"
 #include "platform/ServerProtocol.h"
 
 namespace halvex::sim {
@@ -21,19 +23,21 @@ namespace {
 namespace fs = std::filesystem;
 
 std::string snapshot(std::string_view timestamp, std::string_view ending) {
-  std::string path(paths::kSnapshotFolder);
-  path += paths::kLogDirPrefix;
+  std::string path(trace::kSnapshotFolder);
+  path += trace::kLogDirPrefix;
   path += timestamp;
   path += ending;
   return path;
 }
 
 std::string_view traceSuffix(std::int64_t vendor) {
-  return vendor == 1 ? paths::kQoroTraceSuffix : paths::kVimoTraceSuffix;
+  return vendor == 1 ? trace::kQoroTraceSnapshotDirectorySuffix
+                     : trace::kVimoTraceSnapshotDirectorySuffix;
 }
 
 std::string_view coreDumpSuffix(std::int64_t vendor) {
-  return vendor == 1 ? paths::kQoroCoreDumpSuffix : paths::kVimoCoreDumpSuffix;
+  return vendor == 1 ? trace::kQoroCoreDumpSnapshotDirectorySuffix
+                     : trace::kVimoCoreDumpSnapshotDirectorySuffix;
 }
 
 bool writeText(const fs::path& file, const std::string& text) {
@@ -82,7 +86,7 @@ bool runTar(const std::vector<std::string>& args) {
 // staging folder and renamed into place, so nobody sees half an archive.
 bool writePackage(const fs::path& target, std::string_view description) {
   std::string name = target.filename().string();
-  name.resize(name.size() - paths::kLogPackageExtension.size());
+  name.resize(name.size() - std::string_view(trace::kLogPackageExtension).size());
   const fs::path staging = target.parent_path() / (".staging-" + name);
   std::error_code error;
   fs::remove_all(staging, error);
@@ -103,17 +107,17 @@ std::optional<LogSet> logSetForDump(const MessageDict& request, std::string_view
   const MessageValue* flag = request.get(kKeyTraceDumpStatePerformCompression);
   const bool compression = flag != nullptr && flag->asBool() != nullptr && *flag->asBool();
   const std::string pattern = snapshot(timestamp, "-*");
-  const std::string package = snapshot(timestamp, paths::kLogPackageExtension);
+  const std::string package = snapshot(timestamp, trace::kLogPackageExtension);
   if (action == kCollectTelephonyLogs) {
     if (compression)
       return LogSet{package, package, true};
-    return LogSet{pattern, snapshot(timestamp, paths::kTelephonySuffix), false};
+    return LogSet{pattern, snapshot(timestamp, kTelephonySuffix), false};
   }
   if (action == kCollectTelephonyLogsWithCoredump) {
     // The tool prints the pattern either way; a compressed set still has to match it.
     const std::string folder = snapshot(timestamp, coreDumpSuffix(vendor));
     if (compression)
-      return LogSet{pattern, folder + std::string(paths::kLogPackageExtension), true};
+      return LogSet{pattern, folder + trace::kLogPackageExtension, true};
     return LogSet{pattern, folder, false};
   }
   if (action == kCollectBasebandLogs) {
@@ -135,9 +139,8 @@ LogSetWriter::LogSetWriter(std::string root) : root_(std::move(root)) {}
 bool LogSetWriter::prepare() const {
   if (root_.empty())
     return true;
-  const fs::path scratch =
-      fs::path(root_ + std::string(paths::kScratchFolder)) / std::string(paths::kDIAGScratchDir);
-  if (!fillFolder(scratch, std::string(paths::kDIAGScratchDir), "Live baseband logs")) {
+  const fs::path scratch = fs::path(root_ + trace::kScratchFolder) / diag::config::kDIAGScratchDir;
+  if (!fillFolder(scratch, diag::config::kDIAGScratchDir, "Live baseband logs")) {
     std::fprintf(stderr, "halvex-sim: cannot create %s\n", scratch.c_str());
     return false;
   }
@@ -150,7 +153,7 @@ bool LogSetWriter::write(const LogSet& set, std::string_view description) const 
   const fs::path target = root_ + set.written;
   const std::string name = target.filename().string();
   // The time stamp comes from the scenario; it must stay one file name inside the snapshot folder.
-  if (target.parent_path() != fs::path(root_ + std::string(paths::kSnapshotFolder)).parent_path() ||
+  if (target.parent_path() != fs::path(root_ + trace::kSnapshotFolder).parent_path() ||
       name == "." || name == "..") {
     std::fprintf(stderr, "halvex-sim: not writing %s: the time stamp is not a plain name\n",
                  set.written.c_str());

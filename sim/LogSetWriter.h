@@ -13,24 +13,11 @@
 
 namespace halvex::sim {
 
-// Where logs live on the device. The tool's own copies are in the trace library
-// (halvex/trace/LogLocations.h, DiagConfig.h); the simulator cannot link that library without a
-// platform backend, so these repeat them and a test holds the two equal.
-namespace paths {
-inline constexpr std::string_view kSnapshotFolder =
-    "/var/wireless/Library/Logs/Faultkeep/Baseband/";
-inline constexpr std::string_view kScratchFolder = "/var/wireless/Library/Logs/Halvex/";
-inline constexpr std::string_view kDIAGScratchDir = "DIAG.scratch";
-inline constexpr std::string_view kLogDirPrefix = "log-bb-";
-inline constexpr std::string_view kLogPackageExtension = ".tar.gz";
-inline constexpr std::string_view kQoroTraceSuffix = "-bb-trace";
-inline constexpr std::string_view kVimoTraceSuffix = "-diag";
-inline constexpr std::string_view kQoroCoreDumpSuffix = "-coredump";
-inline constexpr std::string_view kVimoCoreDumpSuffix = "-cd";
-// Telephony logs taken without compression: the tool prints "log-bb-T-*", so any suffix is
-// found; this one says what the folder holds.
+// Where logs live on the device and how they are named are the trace library's
+// (halvex/trace/LogLocations.h, DiagConfig.h): the simulator writes where the tool will look.
+// Telephony logs taken without compression: the tool prints "log-bb-T-*", so any suffix is found;
+// this one says what the folder holds.
 inline constexpr std::string_view kTelephonySuffix = "-tel";
-}  // namespace paths
 
 // One log set: what the tool prints and what the simulator writes for it. They differ only for
 // the pattern form, where the tool prints "log-bb-T-*" and a matching name is written.

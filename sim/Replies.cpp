@@ -50,12 +50,9 @@ std::string summary(const Reply& reply) {
 // The reply's TimestampString, or nullopt for none.
 std::optional<std::string> replyTimestamp(const Answer& answer, bool stampedByDefault) {
   switch (answer.stamp) {
-    case Stamp::kText:
-      return answer.timestamp;
-    case Stamp::kNone:
-      return std::nullopt;
-    case Stamp::kDefault:
-      break;
+    case Stamp::kText: return answer.timestamp;
+    case Stamp::kNone: return std::nullopt;
+    case Stamp::kDefault: break;
   }
   return stampedByDefault ? std::optional(localTimestamp()) : std::nullopt;
 }
@@ -68,20 +65,11 @@ Reply makeReply(std::string asked, const Answer& answer, MessageDict dict,
   reply.asked = std::move(asked);
   reply.code = answer.result;
   switch (answer.reply) {
-    case ReplyKind::kDict:
-      reply.value = MessageValue::dict(std::move(dict));
-      break;
-    case ReplyKind::kNull:
-      break;
-    case ReplyKind::kString:
-      reply.value = MessageValue::string(text);
-      break;
-    case ReplyKind::kInt64:
-      reply.value = MessageValue::int64(0);
-      break;
-    case ReplyKind::kBool:
-      reply.value = MessageValue::boolean(true);
-      break;
+    case ReplyKind::kDict: reply.value = MessageValue::dict(std::move(dict)); break;
+    case ReplyKind::kNull: break;
+    case ReplyKind::kString: reply.value = MessageValue::string(text); break;
+    case ReplyKind::kInt64: reply.value = MessageValue::int64(0); break;
+    case ReplyKind::kBool: reply.value = MessageValue::boolean(true); break;
   }
   return reply;
 }
@@ -124,8 +112,7 @@ void Replier::respond(const Endpoint& endpoint, sd_bus_message* call, const Answ
       endpoint.journal().log(LogLevel::kInfo, reply.asked + ": never answered");
       scheduler_.hold(&endpoint, keep(call));
       return;
-    case Fault::kNone:
-      break;
+    case Fault::kNone: break;
   }
   if (answer.delayMs == 0) {
     send(endpoint, call, reply);

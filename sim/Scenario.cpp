@@ -126,15 +126,11 @@ MessageValue readPayload(const Json& value, const std::string& pointer, int dept
     fail(pointer, "more than " + std::to_string(bus::kMaxValues) + " values in one payload");
   }
   switch (value.type()) {
-    case Json::value_t::null:
-      return MessageValue::null();
-    case Json::value_t::boolean:
-      return MessageValue::boolean(value.get<bool>());
-    case Json::value_t::string:
-      return MessageValue::string(readBusString(value, pointer));
+    case Json::value_t::null: return MessageValue::null();
+    case Json::value_t::boolean: return MessageValue::boolean(value.get<bool>());
+    case Json::value_t::string: return MessageValue::string(readBusString(value, pointer));
     case Json::value_t::number_integer:
-    case Json::value_t::number_unsigned:
-      return MessageValue::int64(readInt64(value, pointer));
+    case Json::value_t::number_unsigned: return MessageValue::int64(readInt64(value, pointer));
     case Json::value_t::object: {
       if (depth >= bus::kMaxDictDepth) {
         fail(pointer, "nested deeper than " + std::to_string(bus::kMaxDictDepth) + " objects");
@@ -152,8 +148,7 @@ MessageValue readPayload(const Json& value, const std::string& pointer, int dept
       }
       return MessageValue::dict(std::move(dict));
     }
-    default:
-      fail(pointer, std::string(typeName(value)) + " has no form on the bus");
+    default: fail(pointer, std::string(typeName(value)) + " has no form on the bus");
   }
 }
 

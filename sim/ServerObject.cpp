@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "platform/ServerProtocol.h"
+#include "platform/linux/BusProtocol.h"
 #include "platform/linux/MessageCodec.h"
 #include "sim/Replies.h"
 #include "sim/RequestLog.h"
@@ -15,21 +16,21 @@
 namespace halvex::sim {
 namespace {
 
-constexpr ObjectNames kNames{"org.halvex.Server", "/org/halvex/Server", "org.halvex.Server1",
-                             "server"};
+constexpr ObjectNames kNames{bus::kServerName, bus::kServerPath, bus::kServerInterface, "server"};
 
 }  // namespace
 
 // Argument names are those of data/dbus/interfaces/*.xml, which a test holds equal to these.
 const sd_bus_vtable ServerObject::kVtable[] = {
     SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD_WITH_NAMES("PerformCommand", "ssa{sv}",
+    SD_BUS_METHOD_WITH_NAMES(bus::kServerPerformCommand, "ssa{sv}",
                              SD_BUS_PARAM(client) SD_BUS_PARAM(command) SD_BUS_PARAM(request),
                              "isv", SD_BUS_PARAM(code) SD_BUS_PARAM(message) SD_BUS_PARAM(reply),
                              &ServerObject::onPerformCommand, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_METHOD_WITH_NAMES("Subscribe", "s", SD_BUS_PARAM(client), "a(sv)", SD_BUS_PARAM(events),
-                             &ServerObject::onSubscribe, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_SIGNAL_WITH_NAMES("Event", "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), 0),
+    SD_BUS_METHOD_WITH_NAMES(bus::kServerSubscribe, "s", SD_BUS_PARAM(client), "a(sv)",
+                             SD_BUS_PARAM(events), &ServerObject::onSubscribe,
+                             SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_SIGNAL_WITH_NAMES(bus::kServerEvent, "sv", SD_BUS_PARAM(name) SD_BUS_PARAM(payload), 0),
     SD_BUS_VTABLE_END};
 
 ServerObject::ServerObject(Server scenario, const DeviceObject& device, const Services& services)
@@ -118,7 +119,8 @@ int ServerObject::emit(const char* name, const MessageValue& payload) {
     return -ENOTCONN;
   }
   sd_bus_message* raw = nullptr;
-  int r = sd_bus_message_new_signal(endpoint_.bus(), &raw, kNames.path, kNames.interface, "Event");
+  int r = sd_bus_message_new_signal(endpoint_.bus(), &raw, kNames.path, kNames.interface,
+                                    bus::kServerEvent);
   MessagePtr message(raw);
   if (r >= 0) {
     r = sd_bus_message_append(raw, "s", name);
@@ -147,7 +149,7 @@ int ServerObject::onPerformCommand(sd_bus_message* call, void* userdata, sd_bus_
       return r;
     }
     self->services_.log.write({{"service", "server"},
-                               {"method", "PerformCommand"},
+                               {"method", bus::kServerPerformCommand},
                                {"client", client},
                                {"command", command},
                                {"keys", describeKeys(request)}});
@@ -198,7 +200,8 @@ int ServerObject::onSubscribe(sd_bus_message* call, void* userdata, sd_bus_error
     if (r < 0) {
       return r;
     }
-    self->services_.log.write({{"service", "server"}, {"method", "Subscribe"}, {"client", client}});
+    self->services_.log.write(
+        {{"service", "server"}, {"method", bus::kServerSubscribe}, {"client", client}});
 
     const std::optional<StateEvent>& state = self->scenario_.state;
     const bool inReply = state && state->when == StateWhen::kSubscribe;

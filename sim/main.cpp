@@ -85,21 +85,11 @@ int main(int argc, char** argv) {
   int id = 0;
   while ((id = getopt_long(argc, argv, "+:hV", kOptions, nullptr)) != -1) {
     switch (id) {
-      case 'h':
-        std::fputs(kUsage, stdout);
-        return 0;
-      case 'V':
-        std::puts("halvex-sim " HALVEX_VERSION);
-        return 0;
-      case kScenario:
-        scenarioPath = optarg;
-        break;
-      case kRequestLog:
-        options.requestLog = optarg;
-        break;
-      case kLogRoot:
-        options.logRoot = optarg;
-        break;
+      case 'h': std::fputs(kUsage, stdout); return 0;
+      case 'V': std::puts("halvex-sim " HALVEX_VERSION); return 0;
+      case kScenario: scenarioPath = optarg; break;
+      case kRequestLog: options.requestLog = optarg; break;
+      case kLogRoot: options.logRoot = optarg; break;
       case kReadyFd: {
         const std::string value = optarg;
         char* end = nullptr;
@@ -113,10 +103,8 @@ int main(int argc, char** argv) {
         ::fcntl(options.readyFd, F_SETFD, FD_CLOEXEC);
         break;
       }
-      case ':':
-        return commandLineError(optionName(optopt) + " needs a value");
-      default:
-        return commandLineError(refusal(optopt, argv[optind - 1]));
+      case ':': return commandLineError(optionName(optopt) + " needs a value");
+      default: return commandLineError(refusal(optopt, argv[optind - 1]));
     }
   }
   if (optind < argc)

@@ -393,6 +393,11 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
   // Before any thread starts: a bus that cannot be reached reads as no radio, and says why.
   ASSERT_EQ(setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/bus", 1), 0);
   EXPECT_EQ(device::getRadioType(), 0);
+  // So does a process check that cannot read /proc, which otherwise only says "not running".
+  {
+    NoMoreDescriptors exhausted;
+    EXPECT_FALSE(device::isProcessRunning("Telvane"));
+  }
   PrivateBus bus;
   SimProcess sim(bus, R"({"server": {"commands": {"Refused": {"result": 7}}}})");
   bus::RunLoopThreadForTesting loop;
@@ -405,19 +410,14 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
       HelperClient::create("logdump.helper", nullptr)
           ->perform(helper::kTaskDiagnosticsCollection, helper::kCommandVarniskStatus, {}, reply)
           .ok());
-  // So does a process check that cannot read /proc, which otherwise only says "not running".
-  {
-    NoMoreDescriptors exhausted;
-    EXPECT_FALSE(device::isProcessRunning("Telvane"));
-  }
   const std::tuple<const char*, std::string, const char*> expected[] = {
       {"device",
        "GetIdentity: code 0xE020E001 in \\S+ ms: no system bus: No such file or directory", "4"},
+      {"device", "process check for Telvane: cannot read /proc: Too many open files", "4"},
       {"device", "GetIdentity: code 0x00000000 in \\S+ ms", "7"},
       {"server", "PerformCommand TraceDumpState: code 0x00000000 in \\S+ ms", "7"},
       {"server", "PerformCommand Refused: code 0x00000007 in \\S+ ms(: .*)?", "4"},
       {"helper", "Perform logdump.helper VarniskStatus: code 0x00000000 in \\S+ ms", "7"},
-      {"device", "process check for Telvane: cannot read /proc: Too many open files", "4"},
   };
   for (const auto& [category, pattern, priority] : expected) {
     auto fields = journal.receive("org.halvex.platform", category);

@@ -67,6 +67,15 @@ TEST(SimBus, AnswersAsTheScenarioSays) {
       {"{}", "Device GetIdentity",
        R"(a{sv} 7 "RadioType" x 1 "RadioVendor" x 2 "ProductType" x 0 "InternalBuild" b true )"
        R"("CarrierBuild" b false "VendorBuild" b false "TraceAllowed" b true)"},
+      // A change of identity is all or nothing.
+      {"{}", "Simulator SetIdentity a{sv} 2 RadioVendor x 1 Colour s red",
+       "Call failed: a key or a type that GetIdentity does not answer with"},
+      {"{}", "Simulator SetIdentity a{sv} 1 RadioType b true",
+       "Call failed: a key or a type that GetIdentity does not answer with"},
+      {"{}", "Simulator SetIdentity a{sv} 2 RadioType x 9 InternalBuild b false", ""},
+      {"{}", "Device GetIdentity",
+       R"(a{sv} 7 "RadioType" x 9 "RadioVendor" x 2 "ProductType" x 0 "InternalBuild" b false )"
+       R"("CarrierBuild" b false "VendorBuild" b false "TraceAllowed" b true)"},
       {"{}", property("BasebandTrace", "Enabled"),
        R"(isv 0 "" a{sv} 1 "TracePropertyValue" s "1")"},
       {"{}", property("SystemLogs", "Mode"), R"(isv 0 "" a{sv} 1 "TracePropertyValue" s "0")"},
@@ -94,6 +103,8 @@ TEST(SimBus, AnswersAsTheScenarioSays) {
       {onDemand, "Server Subscribe s t", "a(sv) 0"},
       {R"({"server": {"state": null}})", "Simulator EmitState",
        "Call failed: the scenario has no state event"},
+      {R"({"device": {"present": false}})", "Simulator SetIdentity a{sv} 0",
+       "Call failed: the device is not on the bus"},
   };
   PrivateBus bus;
   std::unique_ptr<SimProcess> sim;
@@ -103,7 +114,8 @@ TEST(SimBus, AnswersAsTheScenarioSays) {
       sim.reset();
       sim = std::make_unique<SimProcess>(bus, running = c.scenario);
     }
-    EXPECT_EQ(call(bus, c.call), c.answer + "\n") << c.call << " in " << c.scenario;
+    EXPECT_EQ(call(bus, c.call), c.answer.empty() ? "" : c.answer + "\n")
+        << c.call << " in " << c.scenario;
   }
 }
 

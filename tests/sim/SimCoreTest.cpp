@@ -7,8 +7,6 @@
 
 #include <filesystem>
 
-#include "halvex/trace/DiagConfig.h"
-#include "halvex/trace/LogLocations.h"
 #include "platform/ServerProtocol.h"
 #include "sim/LogSetWriter.h"
 #include "sim/Scenario.h"
@@ -86,18 +84,6 @@ TEST(Scenario, EveryExampleScenarioIsValid) {
     EXPECT_NO_THROW(loadScenario(entry.path().string())) << entry.path();
   }
   EXPECT_GE(count, 5);
-}
-
-TEST(LogSetPaths, MatchTheToolsOwnLocations) {
-  EXPECT_EQ(paths::kSnapshotFolder, trace::kSnapshotFolder);
-  EXPECT_EQ(paths::kScratchFolder, trace::kScratchFolder);
-  EXPECT_EQ(paths::kDIAGScratchDir, diag::config::kDIAGScratchDir);
-  EXPECT_EQ(paths::kLogDirPrefix, trace::kLogDirPrefix);
-  EXPECT_EQ(paths::kLogPackageExtension, trace::kLogPackageExtension);
-  EXPECT_EQ(paths::kQoroTraceSuffix, trace::kQoroTraceSnapshotDirectorySuffix);
-  EXPECT_EQ(paths::kVimoTraceSuffix, trace::kVimoTraceSnapshotDirectorySuffix);
-  EXPECT_EQ(paths::kQoroCoreDumpSuffix, trace::kQoroCoreDumpSnapshotDirectorySuffix);
-  EXPECT_EQ(paths::kVimoCoreDumpSuffix, trace::kVimoCoreDumpSnapshotDirectorySuffix);
 }
 
 TEST(LogSetWriter, RefusesATimestampThatLeavesTheSnapshotFolder) {

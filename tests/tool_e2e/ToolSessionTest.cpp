@@ -6,6 +6,7 @@
 #include <termios.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -200,6 +201,39 @@ TEST(ToolTerminal, OutputElsewhereGetsThePlainShell) {
       std::max<ssize_t>(::pread(out, printed.data(), printed.size(), 0), 0)));
   ::close(out);
   EXPECT_EQ(printed, kPrompt + kTel + "Success\n" + kPath + "T.tar.gz\n" + kPrompt);
+}
+
+// The device's build changes while a session runs: the next baseband collection, which asks the
+// helper only on an internal or carrier build, follows it.
+TEST(ToolTerminal, TheHelperFallbackFollowsTheBuildChangingMidSession) {
+  test::PrivateBus bus;
+  test::SimProcess sim(bus, exempt(R"({"commands": {"TraceDumpState": {"result": -534716415}}},
+                                       "helper": {"timestamp": "H9"})"));
+  const test::Pty pty(200);
+  const pid_t tool =
+      test::spawnChild({HALVEXTOOL_BINARY}, {}, {{pty.slave, 0}, {pty.slave, 1}, {pty.slave, 2}});
+  pty.readUntil(kPrompt);
+  const auto collect = [&pty] {
+    pty.type("logdump bb nocompress\r");
+    pty.readUntil("Baseband log collection: ");
+    return pty.readUntil(kPrompt);
+  };
+  const std::string helped = kPath + "H9-diag";
+  const std::string scratch = "Path = /var/wireless/Library/Logs/Halvex/DIAG.scratch";
+  EXPECT_NE(collect().find(helped), std::string::npos);
+  const auto setBuild = [&sim](const char* key, const char* value) {
+    return sim.callControl("SetIdentity", "a{sv}", {"1", key, "b", value}).status.code;
+  };
+  ASSERT_EQ(setBuild("InternalBuild", "false"), 0);
+  EXPECT_NE(collect().find(scratch), std::string::npos);
+  ASSERT_EQ(setBuild("CarrierBuild", "true"), 0);
+  EXPECT_NE(collect().find(helped), std::string::npos);
+  pty.type("\x04");
+  EXPECT_EQ(test::waitChild(tool, std::chrono::seconds(10)).describe(), "exit 1");
+  const std::vector<std::string> requests = commandRequests(sim);
+  EXPECT_EQ(std::count(requests.begin(), requests.end(),
+                       "logdump.helper VarniskStatus task=4 Timeout=1500"),
+            2);
 }
 
 // The simulator keeps processes with the names it is given alive while it runs.

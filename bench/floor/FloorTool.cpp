@@ -19,6 +19,7 @@
 #include <thread>
 
 #include "platform/MessageDict.h"
+#include "platform/linux/BusProtocol.h"
 #include "platform/linux/MessageCodec.h"
 
 namespace {
@@ -33,8 +34,9 @@ MessageValue perform(const char* command, const MessageDict& request) {
   sd_bus_message* call = nullptr;
   sd_bus_message* reply = nullptr;
   MessageValue value;
-  if (sd_bus_message_new_method_call(gBus, &call, "org.halvex.Server", "/org/halvex/Server",
-                                     "org.halvex.Server1", "PerformCommand") >= 0 &&
+  if (sd_bus_message_new_method_call(gBus, &call, halvex::bus::kServerName,
+                                     halvex::bus::kServerPath, halvex::bus::kServerInterface,
+                                     halvex::bus::kServerPerformCommand) >= 0 &&
       sd_bus_message_append(call, "ss", "halvextool", command) >= 0 &&
       halvex::bus::appendDict(call, request) >= 0 &&
       sd_bus_call(gBus, call, 0, nullptr, &reply) >= 0) {
@@ -100,18 +102,20 @@ int main(int argc, char** argv) {
     return 1;
   }
   sd_bus_message* identity = nullptr;
-  sd_bus_call_method(gBus, "org.halvex.Device", "/org/halvex/Device", "org.halvex.Device1",
-                     "GetIdentity", nullptr, &identity, "");
+  sd_bus_call_method(gBus, halvex::bus::kDeviceName, halvex::bus::kDevicePath,
+                     halvex::bus::kDeviceInterface, halvex::bus::kDeviceGetIdentity, nullptr,
+                     &identity, "");
   // The bench's device is an exempt product; the tool scans for the daemon all the same.
   [[maybe_unused]] const bool telvane = commRunning("Telvane");
   sd_bus_message_unref(identity);
-  sd_bus_add_match(gBus, nullptr,
-                   "type='signal',path='/org/halvex/Server',interface='org.halvex.Server1',"
-                   "member='Event'",
-                   nullptr, nullptr);
+  const std::string events = std::string("type='signal',path='") + halvex::bus::kServerPath +
+                             "',interface='" + halvex::bus::kServerInterface + "',member='" +
+                             halvex::bus::kServerEvent + "'";
+  sd_bus_add_match(gBus, nullptr, events.c_str(), nullptr, nullptr);
   sd_bus_message* state = nullptr;
-  sd_bus_call_method(gBus, "org.halvex.Server", "/org/halvex/Server", "org.halvex.Server1",
-                     "Subscribe", nullptr, &state, "s", "halvextool");
+  sd_bus_call_method(gBus, halvex::bus::kServerName, halvex::bus::kServerPath,
+                     halvex::bus::kServerInterface, halvex::bus::kServerSubscribe, nullptr, &state,
+                     "s", "halvextool");
   sd_bus_message_unref(state);
   std::this_thread::sleep_for(std::chrono::milliseconds(500));
   if (!lines) {

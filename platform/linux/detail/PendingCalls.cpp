@@ -2,8 +2,8 @@
 #include "detail/PendingCalls.h"
 
 #include <algorithm>
-#include <cinttypes>
-#include <cstdio>
+#include <cctype>
+#include <charconv>
 #include <utility>
 
 #include "detail/BusSupport.h"
@@ -11,10 +11,22 @@
 namespace halvex::bus {
 
 std::string LoggedOutcome::describe() const {
-  char numbers[64];
-  std::snprintf(numbers, sizeof numbers, ": code 0x%08" PRIX32 " in %" PRIu64 ".%03" PRIu64 " ms",
-                static_cast<std::uint32_t>(result.code), tookUsec / 1000, tookUsec % 1000);
-  std::string text = label + numbers;
+  // By hand rather than with snprintf: this runs for every request.
+  char hex[8];
+  const char* const hexEnd =
+      std::to_chars(hex, hex + sizeof hex, static_cast<std::uint32_t>(result.code), 16).ptr;
+  std::string text = label;
+  text += ": code 0x";
+  text.append(sizeof hex - static_cast<std::size_t>(hexEnd - hex), '0');
+  for (const char* c = hex; c != hexEnd; ++c) {
+    text += static_cast<char>(std::toupper(static_cast<unsigned char>(*c)));
+  }
+  text += " in ";
+  text += std::to_string(tookUsec / 1000);
+  const std::uint64_t fraction = tookUsec % 1000;
+  text += fraction < 10 ? ".00" : fraction < 100 ? ".0" : ".";
+  text += std::to_string(fraction);
+  text += " ms";
   if (!result.message.empty()) {
     text += ": ";
     text += result.message;

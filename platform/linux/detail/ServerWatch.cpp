@@ -104,10 +104,7 @@ void ServerWatch::close() {
 void ServerWatch::connected(sd_bus*) {
   // An owner seen on a connection that went without our noticing is unknown now; the new
   // connection's owner query tells whether it is still there.
-  if (!owner_.empty()) {
-    owner_.clear();
-    postStopped();
-  }
+  forgetOwner();
   if (hub_->token() != 0) {
     watch();
   }
@@ -117,12 +114,16 @@ void ServerWatch::disconnected() {
   matchEpoch_ = 0;
   // A timer of a loop that has stopped never fires; the next loop gets a timer of its own.
   reconnect_.reset();
+  forgetOwner();
+  if (hub_->token() != 0) {
+    scheduleReconnect();
+  }
+}
+
+void ServerWatch::forgetOwner() {
   if (!owner_.empty()) {
     owner_.clear();
     postStopped();
-  }
-  if (hub_->token() != 0) {
-    scheduleReconnect();
   }
 }
 

@@ -47,6 +47,8 @@ class ServerWatch final : public std::enable_shared_from_this<ServerWatch>,
   void scheduleReconnect();
   void queryOwner();
   void ownerSeen(const std::string& owner);
+  // The owner is unknown from now on; the stopped state goes out if one was known.
+  void forgetOwner();
   void subscribe();
   void postStopped();
   void postEvent(std::uint64_t token, std::string event, MessageValue payload);

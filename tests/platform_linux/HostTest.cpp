@@ -394,7 +394,8 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
   ASSERT_EQ(setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/bus", 1), 0);
   EXPECT_EQ(device::getRadioType(), 0);
   // So does a process check that cannot read /proc, which otherwise only says "not running".
-  {
+  const bool exhaustible = *NoMoreDescriptors::impossible() == '\0';
+  if (exhaustible) {
     NoMoreDescriptors exhausted;
     EXPECT_FALSE(device::isProcessRunning("Telvane"));
   }
@@ -420,6 +421,8 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
       {"helper", "Perform logdump.helper VarniskStatus: code 0x00000000 in \\S+ ms", "7"},
   };
   for (const auto& [category, pattern, priority] : expected) {
+    if (!exhaustible && pattern.starts_with("process check"))
+      continue;
     auto fields = journal.receive("org.halvex.platform", category);
     EXPECT_TRUE(std::regex_match(fields["MESSAGE"], std::regex(pattern))) << fields["MESSAGE"];
     EXPECT_EQ(fields["PRIORITY"], priority) << pattern;

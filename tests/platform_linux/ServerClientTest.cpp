@@ -190,6 +190,8 @@ TEST_F(ManagerTest, EveryRequestEndsWhateverBecomesOfTheLoop) {
   for (const std::string fate : {"never started", "could not start", "stopped"}) {
     SCOPED_TRACE(fate);
     if (fate == "could not start") {
+      if (*NoMoreDescriptors::impossible() != '\0')
+        continue;  // the same as "never started" once run() is back
       NoMoreDescriptors exhausted;
       EXPECT_LT(bus::ProcessBus::instance().run(), 0);
     } else if (fate == "stopped") {
@@ -211,7 +213,7 @@ TEST_F(ManagerTest, EveryRequestEndsWhateverBecomesOfTheLoop) {
   loop_.emplace();
   EXPECT_TRUE(barrier());
   ASSERT_TRUE(drain());
-  EXPECT_EQ(mail().size(), 7u);
+  EXPECT_EQ(mail().size(), *NoMoreDescriptors::impossible() == '\0' ? 7u : 5u);
   for (const Delivery& done : mail())
     EXPECT_EQ(done.onQueue, true) << done.name;
 }

@@ -343,17 +343,15 @@ void ProcessBus::cancel(const void* owner, const Result& why) {
   pending_.finishOwned(owner, why);
 }
 
-bool ProcessBus::addMatch(const void* owner, const char* rule, sd_bus_message_handler_t callback,
+void ProcessBus::addMatch(const void* owner, const char* rule, sd_bus_message_handler_t callback,
                           void* userdata) {
   sd_bus_slot* slot = nullptr;
   // An install callback of our own: without one sd-bus closes the connection when the bus
   // refuses the match.
-  if (bus_ == nullptr ||
-      sd_bus_add_match_async(bus_, &slot, rule, callback, &ignoreInstallFailure, userdata) < 0) {
-    return false;
+  if (bus_ != nullptr &&
+      sd_bus_add_match_async(bus_, &slot, rule, callback, &ignoreInstallFailure, userdata) >= 0) {
+    matches_.push_back({owner, slot});
   }
-  matches_.push_back({owner, slot});
-  return true;
 }
 
 void ProcessBus::removeMatches(const void* owner) {

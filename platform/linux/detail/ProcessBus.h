@@ -123,9 +123,9 @@ class ProcessBus final : private HandOver::Keeper {
   void cancel(const void* owner, const Result& why);
 
   // Installs a match on the current connection for owner, without waiting for the bus to
-  // confirm it. It lasts until removeMatches(owner) or the connection goes. False when it could
-  // not be installed: the signals are then missed, but the connection stays.
-  bool addMatch(const void* owner, const char* rule, sd_bus_message_handler_t callback,
+  // confirm it. It lasts until removeMatches(owner) or the connection goes. A match that cannot
+  // be installed costs its signals, not the connection.
+  void addMatch(const void* owner, const char* rule, sd_bus_message_handler_t callback,
                 void* userdata);
   void removeMatches(const void* owner);
 

@@ -10,7 +10,7 @@ namespace halvex {
 namespace {
 
 // /proc/cmdline is at most a few kilobytes; anything beyond this is not a command line.
-constexpr std::size_t kMaxCommandLine = 64 * 1024;
+constexpr std::size_t kMaxCommandLine = std::size_t{64} * 1024;
 
 class LinuxDevicePropertyService final : public DevicePropertyService {
  public:

@@ -44,7 +44,7 @@ class LinuxHelperClient final : public HelperClient {
       return bus::makeResult(kResultInvalidRequest, "command name cannot be sent");
     }
     MessageValue value;
-    const Result result = bus::ProcessBus::instance().call(
+    Result result = bus::ProcessBus::instance().call(
         {bus::kHelperName, bus::kHelperPath, bus::kHelperInterface, bus::kHelperPerform,
          bus::callBounds().helper, "helper",
          std::string(bus::kHelperPerform) + " " + service_ + " " + command},

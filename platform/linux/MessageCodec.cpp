@@ -91,9 +91,7 @@ int putDict(sd_bus_message* message, const MessageDict& dict) {
 int putVariant(sd_bus_message* message, const MessageValue& value) {
   int r = 0;
   switch (value.kind()) {
-    case MessageValue::Kind::kNull:
-      r = putNull(message);
-      break;
+    case MessageValue::Kind::kNull: r = putNull(message); break;
     case MessageValue::Kind::kString:
       // A value that cannot be created on the bus travels as null, and the message still goes.
       if (!isBusString(*value.asString())) {

@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <string>
 #include <string_view>
 
@@ -70,7 +69,7 @@ class Scan {
     failed_ = true;
     LogServer::create()->write(
         LogContext(bus::kLogSubsystem, "device"), LogLevel::kWarning,
-        "process check for " + name_ + ": cannot read " + what + ": " + std::strerror(error));
+        "process check for " + name_ + ": cannot read " + what + ": " + bus::errnoText(error));
   }
 
  private:

@@ -15,20 +15,15 @@ namespace halvex {
 namespace {
 
 // The journal takes large entries, but a runaway message should not become one.
-constexpr std::size_t kMaxLogMessage = 16 * 1024;
+constexpr std::size_t kMaxLogMessage = std::size_t{16} * 1024;
 
 const char* priorityField(LogLevel level) {
   switch (level) {
-    case LogLevel::kDebug:
-      return "PRIORITY=7";
-    case LogLevel::kInfo:
-      return "PRIORITY=6";
-    case LogLevel::kNotice:
-      return "PRIORITY=5";
-    case LogLevel::kWarning:
-      return "PRIORITY=4";
-    case LogLevel::kError:
-      return "PRIORITY=3";
+    case LogLevel::kDebug: return "PRIORITY=7";
+    case LogLevel::kInfo: return "PRIORITY=6";
+    case LogLevel::kNotice: return "PRIORITY=5";
+    case LogLevel::kWarning: return "PRIORITY=4";
+    case LogLevel::kError: return "PRIORITY=3";
   }
   return "PRIORITY=6";
 }

@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <cstring>
 #include <ctime>
+#include <system_error>
 
 #include "platform/linux/MessageCodec.h"
 
@@ -21,20 +22,21 @@ Result makeResult(std::int32_t code, std::string_view message) {
   return Result{code, boundedText(message)};
 }
 
+std::string errnoText(int error) {
+  return std::generic_category().message(error);
+}
+
 namespace {
 
 std::int32_t codeForLocalErrno(int r) {
   switch (r) {
     case -ENOBUFS:  // sd-bus's own queue of unsent messages is full
       return kResultLimitsExceeded;
-    case -ETIMEDOUT:
-      return kResultTimeout;
+    case -ETIMEDOUT: return kResultTimeout;
     case -ENOTCONN:
     case -ECONNRESET:
-    case -EPIPE:
-      return kResultConnectionLost;
-    default:
-      return kResultBusError;
+    case -EPIPE: return kResultConnectionLost;
+    default: return kResultBusError;
   }
 }
 
@@ -48,7 +50,7 @@ std::uint64_t monotonicUsec() {
 }
 
 Result resultFromErrno(sd_bus* bus, int r) {
-  std::string text = std::string("errno ") + std::to_string(-r) + ": " + std::strerror(-r);
+  std::string text = std::string("errno ") + std::to_string(-r) + ": " + errnoText(-r);
   if (bus != nullptr && sd_bus_is_open(bus) <= 0) {
     return makeResult(kResultConnectionLost, text);
   }
@@ -90,8 +92,7 @@ Result resultFromErrorReply(sd_bus* bus, sd_bus_message* reply) {
 }
 
 Result resultFromOpenFailure(int r) {
-  return makeResult(kResultServerNotRunning,
-                    std::string("no system bus: ") + std::strerror(r < 0 ? -r : r));
+  return makeResult(kResultServerNotRunning, "no system bus: " + errnoText(r < 0 ? -r : r));
 }
 
 std::string ownerChangedRule(const char* name) {
@@ -123,8 +124,7 @@ Result readOutcome(sd_bus_message* reply, MessageValue& value) {
   MessageValue decoded;
   r = readVariant(reply, decoded);
   if (r < 0) {
-    return makeResult(kResultBadReply,
-                      std::string("reply value outside the mapping: ") + std::strerror(-r));
+    return makeResult(kResultBadReply, "reply value outside the mapping: " + errnoText(-r));
   }
   value = std::move(decoded);
   return makeResult(code, message != nullptr ? message : "");

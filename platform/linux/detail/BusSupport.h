@@ -42,6 +42,9 @@ std::string boundedText(std::string_view text);
 
 Result makeResult(std::int32_t code, std::string_view message);
 
+// What errno value error means, in words (strerror's text, but safe from any thread).
+std::string errnoText(int error);
+
 // The monotonic clock in microseconds, as sd-event counts it.
 std::uint64_t monotonicUsec();
 

@@ -7,7 +7,6 @@
 
 #include <cerrno>
 #include <cstdlib>
-#include <cstring>
 #include <utility>
 
 #include "detail/Wakeup.h"
@@ -182,8 +181,7 @@ bool ProcessBus::send(const CallPlan& plan, const MessageBuilder& build, ReplyHa
     }
     r = build ? build(message.get()) : 0;
     if (r < 0) {
-      return fail(makeResult(kResultInvalidRequest,
-                             std::string("request cannot be encoded: ") + std::strerror(-r)));
+      return fail(makeResult(kResultInvalidRequest, "request cannot be encoded: " + errnoText(-r)));
     }
     // No time-out of sd-bus's own (UINT64_MAX): the deadline is the only one.
     r = sd_bus_call_async(bus, &call->slot, message.get(), &ProcessBus::onReply, call.get(),

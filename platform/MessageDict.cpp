@@ -75,18 +75,10 @@ void appendQuoted(std::string& out, const std::string& text) {
 
 void appendValue(std::string& out, const MessageValue& value) {
   switch (value.kind()) {
-    case MessageValue::Kind::kNull:
-      out += "null";
-      break;
-    case MessageValue::Kind::kString:
-      appendQuoted(out, *value.asString());
-      break;
-    case MessageValue::Kind::kInt64:
-      out += std::to_string(*value.asInt64());
-      break;
-    case MessageValue::Kind::kBool:
-      out += *value.asBool() ? "true" : "false";
-      break;
+    case MessageValue::Kind::kNull: out += "null"; break;
+    case MessageValue::Kind::kString: appendQuoted(out, *value.asString()); break;
+    case MessageValue::Kind::kInt64: out += std::to_string(*value.asInt64()); break;
+    case MessageValue::Kind::kBool: out += *value.asBool() ? "true" : "false"; break;
     case MessageValue::Kind::kDict: {
       out += '{';
       bool first = true;

@@ -1,13 +1,14 @@
 # SPDX-License-Identifier: MIT
 # Debian packages the build, the tests and the demo need. Sourced by the other scripts.
 # clang and libclang-rt-14-dev (sanitizer runtimes and libFuzzer) serve the clang and fuzz presets;
-# clang-tidy-14 scripts/tidy.sh; dpkg-dev, file, lintian, mandoc, groff-base, devscripts
+# clang-tidy-14 scripts/tidy.sh; clang-format-15 (the first with InsertBraces)
+# scripts/check-format.sh; dpkg-dev, file, lintian, mandoc, groff-base, devscripts
 # (hardening-check), abigail-tools, zsh and dbus-broker the package check, whose package build
 # brings what debian/control asks for (ensure_build_dependencies).
-halvex_packages=(cmake make g++ clang libclang-rt-14-dev clang-tidy-14 pkgconf libgtest-dev
-  libgmock-dev libbenchmark-dev libsystemd-dev nlohmann-json3-dev dbus-daemon systemd tar gzip
-  util-linux procps mandoc dpkg-dev file lintian groff-base bash-completion dbus-system-bus-common
-  devscripts abigail-tools zsh dbus-broker)
+halvex_packages=(cmake make g++ clang libclang-rt-14-dev clang-tidy-14 clang-format-15 pkgconf
+  libgtest-dev libgmock-dev libbenchmark-dev libsystemd-dev nlohmann-json3-dev dbus-daemon systemd
+  tar gzip util-linux procps mandoc dpkg-dev file lintian groff-base bash-completion
+  dbus-system-bus-common devscripts abigail-tools zsh dbus-broker)
 
 ensure_packages() {
   local missing=() p

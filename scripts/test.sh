@@ -10,6 +10,7 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/packages.sh
 ensure_packages
+bash scripts/check-format.sh
 
 presets=("$@")
 ((${#presets[@]})) || presets=(dev asan tsan clang fuzz)

@@ -50,8 +50,9 @@ bool writeText(const fs::path& file, const std::string& text) {
 bool fillFolder(const fs::path& folder, const std::string& name, std::string_view description) {
   std::error_code error;
   fs::create_directories(folder, error);
-  if (error)
+  if (error) {
     return false;
+  }
   return writeText(folder / "summary.txt",
                    "Simulated log set " + name + "\n" + std::string(description) + "\n") &&
          writeText(folder / "baseband.log", "00:00:00.000 simulated baseband trace\n") &&
@@ -61,12 +62,14 @@ bool fillFolder(const fs::path& folder, const std::string& name, std::string_vie
 // tar from PATH, with a clean signal mask: the daemon blocks SIGTERM for its event loop.
 bool runTar(const std::vector<std::string>& args) {
   std::vector<char*> argv;
-  for (const auto& arg : args)
+  for (const auto& arg : args) {
     argv.push_back(const_cast<char*>(arg.c_str()));
+  }
   argv.push_back(nullptr);
   const pid_t pid = ::fork();
-  if (pid < 0)
+  if (pid < 0) {
     return false;
+  }
   if (pid == 0) {
     sigset_t none;
     ::sigemptyset(&none);
@@ -76,8 +79,9 @@ bool runTar(const std::vector<std::string>& args) {
   }
   int status = 0;
   while (::waitpid(pid, &status, 0) < 0) {
-    if (errno != EINTR)
+    if (errno != EINTR) {
       return false;
+    }
   }
   return WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
@@ -93,8 +97,9 @@ bool writePackage(const fs::path& target, std::string_view description) {
   const fs::path partial = staging / "package.tar.gz";
   const bool ok = fillFolder(staging / name, name, description) &&
                   runTar({"tar", "-czf", partial.string(), "-C", staging.string(), name});
-  if (ok)
+  if (ok) {
     fs::rename(partial, target, error);
+  }
   fs::remove_all(staging, error);
   return ok && !error;
 }
@@ -109,20 +114,23 @@ std::optional<LogSet> logSetForDump(const MessageDict& request, std::string_view
   const std::string pattern = snapshot(timestamp, "-*");
   const std::string package = snapshot(timestamp, trace::kLogPackageExtension);
   if (action == kCollectTelephonyLogs) {
-    if (compression)
+    if (compression) {
       return LogSet{package, package, true};
+    }
     return LogSet{pattern, snapshot(timestamp, kTelephonySuffix), false};
   }
   if (action == kCollectTelephonyLogsWithCoredump) {
     // The tool prints the pattern either way; a compressed set still has to match it.
     const std::string folder = snapshot(timestamp, coreDumpSuffix(vendor));
-    if (compression)
+    if (compression) {
       return LogSet{pattern, folder + trace::kLogPackageExtension, true};
+    }
     return LogSet{pattern, folder, false};
   }
   if (action == kCollectBasebandLogs) {
-    if (compression)
+    if (compression) {
       return LogSet{package, package, true};
+    }
     const std::string folder = snapshot(timestamp, traceSuffix(vendor));
     return LogSet{folder, folder, false};
   }
@@ -137,8 +145,9 @@ LogSet logSetForHelper(std::string_view timestamp, std::int64_t vendor) {
 LogSetWriter::LogSetWriter(std::string root) : root_(std::move(root)) {}
 
 bool LogSetWriter::prepare() const {
-  if (root_.empty())
+  if (root_.empty()) {
     return true;
+  }
   const fs::path scratch = fs::path(root_ + trace::kScratchFolder) / diag::config::kDIAGScratchDir;
   if (!fillFolder(scratch, diag::config::kDIAGScratchDir, "Live baseband logs")) {
     std::fprintf(stderr, "halvex-sim: cannot create %s\n", scratch.c_str());
@@ -148,8 +157,9 @@ bool LogSetWriter::prepare() const {
 }
 
 bool LogSetWriter::write(const LogSet& set, std::string_view description) const {
-  if (root_.empty())
+  if (root_.empty()) {
     return true;
+  }
   const fs::path target = root_ + set.written;
   const std::string name = target.filename().string();
   // The time stamp comes from the scenario; it must stay one file name inside the snapshot folder.
@@ -160,13 +170,15 @@ bool LogSetWriter::write(const LogSet& set, std::string_view description) const 
     return false;
   }
   std::error_code error;
-  if (fs::exists(target, error))
+  if (fs::exists(target, error)) {
     return true;
+  }
   fs::create_directories(target.parent_path(), error);
   const bool ok = !error && (set.package ? writePackage(target, description)
                                          : fillFolder(target, name, description));
-  if (!ok)
+  if (!ok) {
     std::fprintf(stderr, "halvex-sim: cannot write %s\n", target.c_str());
+  }
   return ok;
 }
 

@@ -21,8 +21,9 @@ constexpr const char* kSleep = "/bin/sleep";
 }  // namespace
 
 ProcessKeeper::~ProcessKeeper() {
-  for (pid_t pid : pids_)
+  for (pid_t pid : pids_) {
     ::kill(pid, SIGKILL);
+  }
   for (pid_t pid : pids_) {
     while (::waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
     }
@@ -30,8 +31,9 @@ ProcessKeeper::~ProcessKeeper() {
 }
 
 void ProcessKeeper::start(const std::vector<std::string>& names) {
-  if (names.empty())
+  if (names.empty()) {
     return;
+  }
   std::string dir = (std::filesystem::temp_directory_path() / "halvex-sim-XXXXXX").string();
   if (::mkdtemp(dir.data()) == nullptr) {
     throw std::runtime_error(std::string("cannot create a folder for processes: ") +
@@ -67,8 +69,9 @@ void ProcessKeeper::start(const std::vector<std::string>& names) {
     if (pid == 0) {
       // Die with the simulator however it ends; the check covers a parent already gone.
       ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-      if (::getppid() != self)
+      if (::getppid() != self) {
         ::_exit(0);
+      }
       sigset_t none;
       ::sigemptyset(&none);
       ::sigprocmask(SIG_SETMASK, &none, nullptr);

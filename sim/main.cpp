@@ -59,8 +59,9 @@ int commandLineError(const std::string& problem) {
 
 std::string optionName(int id) {
   for (const option& o : kOptions) {
-    if (o.name != nullptr && o.val == id)
+    if (o.name != nullptr && o.val == id) {
       return std::string("--") + o.name;
+    }
   }
   return std::string("-") + static_cast<char>(id);
 }
@@ -69,8 +70,9 @@ std::string optionName(int id) {
 // short one is only known by its letter, which may sit inside a cluster such as -hx.
 std::string refusal(int id, const char* arg) {
   const std::string_view text = arg;
-  if (text.substr(0, 2) != "--")
+  if (text.substr(0, 2) != "--") {
     return "unknown option -" + std::string(1, static_cast<char>(id));
+  }
   const std::string name(text.substr(0, text.find('=')));
   return id != 0 ? name + " takes no value" : "unknown or ambiguous option " + name;
 }
@@ -107,8 +109,9 @@ int main(int argc, char** argv) {
       default: return commandLineError(refusal(optopt, argv[optind - 1]));
     }
   }
-  if (optind < argc)
+  if (optind < argc) {
     return commandLineError(std::string("unexpected argument ") + argv[optind]);
+  }
 
   if (scenarioPath.empty()) {
     for (const char* candidate : kDefaultScenarios) {

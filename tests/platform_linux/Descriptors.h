@@ -39,8 +39,9 @@ class NoMoreDescriptors {
 
 inline int openDescriptors() {
   int count = 0;
-  for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator("/proc/self/fd"))
+  for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
     ++count;
+  }
   return count;
 }
 

@@ -81,18 +81,22 @@ class DeviceService {
                                   nameFlags | SD_BUS_NAME_ALLOW_REPLACEMENT) >= 0;
           ready_.set_value(ok);
           while (ok && !stop.stop_requested()) {
-            if (signal_.exchange(false))
+            if (signal_.exchange(false)) {
               sd_bus_emit_signal(bus, "/org/halvex/Device", "org.halvex.Device1", "IdentityChanged",
                                  "");
-            if (leave_.exchange(false))
+            }
+            if (leave_.exchange(false)) {
               sd_bus_release_name(bus, "org.halvex.Device");
-            if (sd_bus_process(bus, nullptr) == 0)
+            }
+            if (sd_bus_process(bus, nullptr) == 0) {
               sd_bus_wait(bus, 10'000);
+            }
           }
           sd_bus_flush_close_unref(bus);
         }) {
-    if (!ready_.get_future().get())
+    if (!ready_.get_future().get()) {
       throw std::runtime_error("the test's device service could not start");
+    }
   }
   void signalChange() { signal_ = true; }
   void leave() { leave_ = true; }
@@ -115,8 +119,9 @@ class DeviceService {
 bool radioBecomes(int expected) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
   while (device::getRadioType() != expected) {
-    if (std::chrono::steady_clock::now() > deadline)
+    if (std::chrono::steady_clock::now() > deadline) {
       return false;
+    }
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
   return true;
@@ -130,8 +135,9 @@ TEST(DeviceIdentityTest, KeptUntilTheServiceSaysOtherwise) {
   std::optional<bus::RunLoopThreadForTesting> loop;
   for (const bool withLoop : {false, true}) {
     SCOPED_TRACE(withLoop ? "with a run loop" : "without a run loop");
-    if (withLoop)
+    if (withLoop) {
       loop.emplace();
+    }
     std::optional<DeviceService> first(std::in_place, 1), second;
     ASSERT_TRUE(radioBecomes(1));
     // The service's taking its name may be read while the first question is out, and then the
@@ -202,8 +208,9 @@ TEST(LeakTest, RepeatedWorkLeavesNothingBehind) {
       EXPECT_FALSE(device::isProcessRunning("halvex-absent"));
       manager.reset();
       // The first round opens what lasts (the journal's socket, say).
-      if (round > 0)
+      if (round > 0) {
         seen.emplace(openDescriptors(), matchRules(bus));
+      }
     }
     bus.restart();
   }
@@ -263,8 +270,9 @@ TEST(ProcessCheckTest, FindsProcessesByTheirWholeName) {
   EXPECT_TRUE(device::isProcessRunning(longName));
   EXPECT_TRUE(device::isProcessRunning(shortName));
   for (const std::string& wrong : {longName.substr(0, 15), longName + "x",
-                                   shortName.substr(0, shortName.size() - 1), std::string()})
+                                   shortName.substr(0, shortName.size() - 1), std::string()}) {
     EXPECT_FALSE(device::isProcessRunning(wrong)) << wrong;
+  }
   // Even a simulator killed outright takes them along.
   sim.kill(SIGKILL);
   EXPECT_EQ(sim.waitExit().signal, SIGKILL);
@@ -272,8 +280,9 @@ TEST(ProcessCheckTest, FindsProcessesByTheirWholeName) {
     return device::isProcessRunning(longName) || device::isProcessRunning(shortName);
   };
   for (const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(15);
-       running() && std::chrono::steady_clock::now() < deadline;)
+       running() && std::chrono::steady_clock::now() < deadline;) {
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
   EXPECT_FALSE(running());
   // An ended process keeps its name until it is reaped.
   const pid_t child = fork();
@@ -295,8 +304,9 @@ TEST(DevicePropertyTest, BootArgumentsAreTheKernelCommandLine) {
 
   // Whatever the file holds: no more than 64 KiB of it, without its trailing terminators.
   if (::geteuid() != 0 || ::unshare(CLONE_NEWNS) != 0 ||
-      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0)
+      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
     GTEST_SKIP() << "only root can stand a file in for /proc/cmdline";
+  }
   TempDir dir;
   const fs::path fake = dir.path() / "cmdline";
   const std::pair<std::string, std::string> cases[] = {
@@ -349,8 +359,9 @@ class FakeJournal {
         const std::size_t equals = data.find('=', at);
         fields[data.substr(at, equals - at)] = data.substr(equals + 1, end - equals - 1);
       }
-      if (fields["SUBSYSTEM"] == subsystem && fields["CATEGORY"] == category)
+      if (fields["SUBSYSTEM"] == subsystem && fields["CATEGORY"] == category) {
         return fields;
+      }
     }
     return {};
   }
@@ -365,8 +376,9 @@ class FakeJournal {
 // at debug.
 TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
   FakeJournal journal;
-  if (!journal.problem().empty())
+  if (!journal.problem().empty()) {
     GTEST_SKIP() << journal.problem();
+  }
   auto server = LogServer::create();
   const LogContext context("org.halvex.test", "journal-test");
   const std::pair<LogLevel, std::string> rows[] = {
@@ -421,8 +433,9 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
       {"helper", "Perform logdump.helper VarniskStatus: code 0x00000000 in \\S+ ms", "7"},
   };
   for (const auto& [category, pattern, priority] : expected) {
-    if (!exhaustible && pattern.starts_with("process check"))
+    if (!exhaustible && pattern.starts_with("process check")) {
       continue;
+    }
     auto fields = journal.receive("org.halvex.platform", category);
     EXPECT_TRUE(std::regex_match(fields["MESSAGE"], std::regex(pattern))) << fields["MESSAGE"];
     EXPECT_EQ(fields["PRIORITY"], priority) << pattern;

@@ -40,15 +40,17 @@ void seal(const Message& message) {
 
 MessageValue dictOf(std::initializer_list<std::pair<const char*, MessageValue>> entries) {
   MessageDict dict;
-  for (const auto& [key, value] : entries)
+  for (const auto& [key, value] : entries) {
     dict.set(key, value);
+  }
   return MessageValue::dict(std::move(dict));
 }
 
 MessageValue nested(int depth) {
   MessageValue value = MessageValue::string("leaf");
-  for (int i = 0; i < depth; ++i)
+  for (int i = 0; i < depth; ++i) {
     value = dictOf({{"inner", value}});
+  }
   return value;
 }
 
@@ -122,8 +124,9 @@ TEST(CodecTest, StringsTheBusCannotCarryTravelAsNull) {
 
 TEST(CodecTest, UnsendableShapesAreRejectedBeforeAnythingIsAppended) {
   MessageDict tooWide;
-  for (std::size_t i = 0; i <= kMaxDictEntries; ++i)
+  for (std::size_t i = 0; i <= kMaxDictEntries; ++i) {
     tooWide.set("k" + std::to_string(i), MessageValue());
+  }
   const std::pair<MessageValue, int> cases[] = {
       {dictOf({{"ok", MessageValue()}, {"\xfe", MessageValue()}}), -EINVAL},
       {nested(kMaxDictDepth + 1), -EINVAL},
@@ -175,8 +178,9 @@ TEST(CodecTest, ForeignShapesAreRefusedWithoutCrashing) {
        [](sd_bus_message* m) {
          sd_bus_message_open_container(m, 'v', "a{sv}");
          sd_bus_message_open_container(m, 'a', "{sv}");
-         for (std::size_t i = 0; i <= kMaxDictEntries; ++i)
+         for (std::size_t i = 0; i <= kMaxDictEntries; ++i) {
            sd_bus_message_append(m, "{sv}", std::to_string(i).c_str(), "b", 1);
+         }
          sd_bus_message_close_container(m);
          return sd_bus_message_close_container(m);
        }},

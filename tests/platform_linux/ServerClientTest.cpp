@@ -41,8 +41,9 @@ class ManagerTest : public ::testing::Test {
   // Anything that changes the environment must come before: this is where threads start.
   void start(const std::string& scenario, bool withLoop = true) {
     sim_.emplace(bus_, scenario);
-    if (withLoop)
+    if (withLoop) {
       loop_.emplace();
+    }
     queue_.emplace(WorkQueue::create("test.queue"));
     manager_ = client::CreateManager("halvextool", *queue_);
   }
@@ -82,9 +83,10 @@ class ManagerTest : public ::testing::Test {
   // The server states the state events told, in order.
   std::vector<std::string> states() {
     std::vector<std::string> out;
-    for (const Delivery& event : mail(kEventServerStateChange))
+    for (const Delivery& event : mail(kEventServerStateChange)) {
       out.push_back(event.value.isDict() ? event.value.asDict()->getString(kKeyServerState)
                                          : describe(event.value));
+    }
     return out;
   }
 
@@ -149,8 +151,9 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
             R"({"key":"a","type":"string","value":"inner"}]}])");
   EXPECT_EQ(client::PerformCommand(manager_, "Refused", {}, reply).code, 7);
   EXPECT_EQ(reply, MessageValue::string("kept"));
-  for (const std::string& command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')})
+  for (const std::string& command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')}) {
     EXPECT_EQ(client::PerformCommand(manager_, command, {}, reply).code, kResultInvalidRequest);
+  }
   MessageDict badKey;
   badKey.set("\xff", MessageValue::null());
   EXPECT_EQ(client::PerformCommand(manager_, "Fine", badKey, reply).code, kResultInvalidRequest);
@@ -190,8 +193,9 @@ TEST_F(ManagerTest, EveryRequestEndsWhateverBecomesOfTheLoop) {
   for (const std::string fate : {"never started", "could not start", "stopped"}) {
     SCOPED_TRACE(fate);
     if (fate == "could not start") {
-      if (*NoMoreDescriptors::impossible() != '\0')
+      if (*NoMoreDescriptors::impossible() != '\0') {
         continue;  // the same as "never started" once run() is back
+      }
       NoMoreDescriptors exhausted;
       EXPECT_LT(bus::ProcessBus::instance().run(), 0);
     } else if (fate == "stopped") {
@@ -214,8 +218,9 @@ TEST_F(ManagerTest, EveryRequestEndsWhateverBecomesOfTheLoop) {
   EXPECT_TRUE(barrier());
   ASSERT_TRUE(drain());
   EXPECT_EQ(mail().size(), *NoMoreDescriptors::impossible() == '\0' ? 7u : 5u);
-  for (const Delivery& done : mail())
+  for (const Delivery& done : mail()) {
     EXPECT_EQ(done.onQueue, true) << done.name;
+  }
 }
 
 // A server of our own, on its own thread: commands get the bus driver's error for an absent
@@ -234,8 +239,9 @@ class RogueServer {
       sd_bus_message* reply = nullptr;
       sd_bus_message_new_method_return(call, &reply);
       sd_bus_message_open_container(reply, 'a', "(sv)");
-      for (int i = 0; i + 1 < kListed; ++i)
+      for (int i = 0; i + 1 < kListed; ++i) {
         sd_bus_message_append(reply, "(sv)", "Noise", "x", std::int64_t{i});
+      }
       sd_bus_message_append(reply, "(sv)", "ServerStateChange", "a{sv}", 1, "ServerState", "s",
                             "Started");
       sd_bus_message_close_container(reply);
@@ -247,9 +253,10 @@ class RogueServer {
         sd_bus_message_skip(call, "s") >= 0) {
       const char* command = nullptr;
       if (sd_bus_message_read(call, "s", &command) > 0 && std::string_view(command) == "Flood") {
-        for (int i = 0; i < kFlood; ++i)
+        for (int i = 0; i < kFlood; ++i) {
           sd_bus_emit_signal(sd_bus_message_get_bus(call), "/org/halvex/Server",
                              "org.halvex.Server1", "Event", "sv", "Noise", "x", std::int64_t{i});
+        }
       }
     }
     return sd_bus_reply_method_errorf(call, SD_BUS_ERROR_SERVICE_UNKNOWN, "not me");
@@ -262,8 +269,9 @@ class RogueServer {
               sd_bus_request_name(bus, "org.halvex.Server", 0) >= 0;
     ready_.set_value(ok);
     while (ok && !stop.stop_requested()) {
-      if (sd_bus_process(bus, nullptr) == 0)
+      if (sd_bus_process(bus, nullptr) == 0) {
         sd_bus_wait(bus, 50000);
+      }
     }
     sd_bus_flush_close_unref(bus);
   }};
@@ -306,8 +314,9 @@ TEST_F(ManagerTest, OnlyTheBusDriverSaysTheServerIsNotRunning) {
 TEST_F(ManagerTest, PendingCallsAreBoundedAndEachCompletesOnceWhenTheManagerGoes) {
   start(R"({"server": {"commands": {"Hang": {"fault": "never_answer"}}}})");
   constexpr int kCalls = 1500;  // beyond what one manager keeps pending
-  for (int i = 0; i < kCalls; ++i)
+  for (int i = 0; i < kCalls; ++i) {
     client::PerformCommand(manager_, "Hang", record(std::to_string(i)), {});
+  }
   manager_.reset();
   ASSERT_TRUE(waitFor(kCalls) && drain());
   std::map<std::int32_t, int> codes;
@@ -353,8 +362,9 @@ TEST_F(ManagerTest, ManyThreadsShareOneManager) {
   EXPECT_EQ(failures.load(), 0);
   ASSERT_TRUE(waitFor(kThreads * kCalls, "async") && drain());
   EXPECT_EQ(mail("async").size(), static_cast<std::size_t>(kThreads * kCalls));
-  for (const Delivery& done : mail("async"))
+  for (const Delivery& done : mail("async")) {
     EXPECT_TRUE(done.result.ok() && done.onQueue) << done.result.message;
+  }
 }
 
 // A server that comes late, reports its state late, leaves with a request unanswered, comes
@@ -395,8 +405,9 @@ TEST_F(ManagerTest, EventsFollowTheServerComingAndGoing) {
   EXPECT_EQ(states(), (std::vector<std::string>{kServerStateStarted, "Stopped", kServerStateStarted,
                                                 kServerStateStarted, "Stopped", kServerStateStarted,
                                                 "Stopped"}));
-  for (const Delivery& delivery : mail())
+  for (const Delivery& delivery : mail()) {
     EXPECT_TRUE(delivery.onQueue) << delivery.name;
+  }
 }
 
 // Events come only from the server's owner, and only while on: switching them off drops those

@@ -31,8 +31,9 @@ std::runtime_error systemError(const std::string& what, int error = errno) {
 
 std::vector<char*> pointers(const std::vector<std::string>& strings) {
   std::vector<char*> result;
-  for (const auto& s : strings)
+  for (const auto& s : strings) {
     result.push_back(const_cast<char*>(s.c_str()));
+  }
   result.push_back(nullptr);
   return result;
 }
@@ -41,8 +42,9 @@ std::vector<char*> pointers(const std::vector<std::string>& strings) {
 [[noreturn]] void execChild(pid_t parent, const std::vector<FdMapping>& fds, char* const* argv,
                             char* const* envp) {
   ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-  if (::getppid() != parent)
+  if (::getppid() != parent) {
     ::_exit(127);
+  }
   // A test that ignores SIGPIPE or blocks signals must not hand that on.
   sigset_t none;
   ::sigemptyset(&none);
@@ -50,12 +52,14 @@ std::vector<char*> pointers(const std::vector<std::string>& strings) {
   ::signal(SIGPIPE, SIG_DFL);
 
   for (const FdMapping& m : fds) {
-    if (::dup2(m.parentFd, m.childFd) < 0)
+    if (::dup2(m.parentFd, m.childFd) < 0) {
       ::_exit(127);
+    }
   }
   ::syscall(SYS_close_range, 3U, ~0U, CLOSE_RANGE_CLOEXEC);
-  for (const FdMapping& m : fds)
+  for (const FdMapping& m : fds) {
     ::fcntl(m.childFd, F_SETFD, 0);
+  }
   ::execve(argv[0], argv, envp);
   ::_exit(127);
 }
@@ -65,8 +69,9 @@ struct Streams {
   int fds[3] = {::memfd_create("in", MFD_CLOEXEC), ::memfd_create("out", MFD_CLOEXEC),
                 ::memfd_create("err", MFD_CLOEXEC)};
   ~Streams() {
-    for (int fd : fds)
+    for (int fd : fds) {
       ::close(fd);
+    }
   }
   std::string text(int i) const {
     std::ifstream in("/proc/self/fd/" + std::to_string(fds[i]), std::ios::binary);
@@ -83,8 +88,9 @@ using std::chrono::milliseconds;
 std::string startReporting(const std::vector<std::string>& args, const EnvChanges& env,
                            const std::string& errPath, pid_t& pid) {
   int report[2];
-  if (::pipe2(report, O_CLOEXEC) != 0)
+  if (::pipe2(report, O_CLOEXEC) != 0) {
     throw systemError("pipe2");
+  }
   const int err = ::open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
   pid = spawnChild(args, env, {{report[1], 3}, {err, 2}});
   ::close(report[1]);
@@ -96,8 +102,9 @@ std::string startReporting(const std::vector<std::string>& args, const EnvChange
     const auto left = std::chrono::duration_cast<milliseconds>(deadline - Clock::now()).count();
     char c;
     if (left <= 0 || ::poll(&ready, 1, static_cast<int>(left)) != 1 ||
-        ::read(report[0], &c, 1) != 1)
+        ::read(report[0], &c, 1) != 1) {
       break;
+    }
     line += c;
   }
   ::close(report[0]);
@@ -105,8 +112,9 @@ std::string startReporting(const std::vector<std::string>& args, const EnvChange
 }
 
 std::string program(const char* path, const char* name) {
-  if (*path == '\0')
+  if (*path == '\0') {
     throw std::runtime_error(std::string("this test binary was built without ") + name);
+  }
   return path;
 }
 
@@ -126,24 +134,29 @@ std::string ExitStatus::describe() const {
 
 pid_t spawnChild(const std::vector<std::string>& args, const EnvChanges& env,
                  const std::vector<FdMapping>& fds) {
-  if (args.empty() || ::access(args[0].c_str(), X_OK) != 0)
+  if (args.empty() || ::access(args[0].c_str(), X_OK) != 0) {
     throw systemError("cannot start " + (args.empty() ? std::string("nothing") : args[0]));
+  }
   std::vector<std::string> environment;
-  for (char** entry = environ; *entry != nullptr; ++entry)
+  for (char** entry = environ; *entry != nullptr; ++entry) {
     environment.emplace_back(*entry);
+  }
   for (const auto& [name, value] : env) {
     const std::string prefix = name + "=";
     std::erase_if(environment, [&prefix](const std::string& e) { return e.starts_with(prefix); });
-    if (value)
+    if (value) {
       environment.push_back(prefix + *value);
+    }
   }
   const std::vector<char*> argv = pointers(args), envp = pointers(environment);
   const pid_t parent = ::getpid();
   const pid_t pid = ::fork();
-  if (pid < 0)
+  if (pid < 0) {
     throw systemError("fork");
-  if (pid == 0)
+  }
+  if (pid == 0) {
     execChild(parent, fds, argv.data(), envp.data());
+  }
   return pid;
 }
 
@@ -163,8 +176,9 @@ ExitStatus waitChild(pid_t pid, std::chrono::milliseconds timeout) {
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
-  if (done != pid)
+  if (done != pid) {
     throw systemError("waitpid");
+  }
   status.exited = WIFEXITED(raw);
   status.code = status.exited ? WEXITSTATUS(raw) : -1;
   status.signal = WIFSIGNALED(raw) ? WTERMSIG(raw) : 0;
@@ -176,8 +190,9 @@ RunResult runProcess(const RunOptions& options) {
   const auto [in, out, err] = streams.fds;
   const auto size = static_cast<ssize_t>(options.input.size());
   if (in < 0 || out < 0 || err < 0 ||
-      ::pwrite(in, options.input.data(), options.input.size(), 0) != size)
+      ::pwrite(in, options.input.data(), options.input.size(), 0) != size) {
     throw systemError("cannot prepare the standard streams");
+  }
   RunResult result;
   result.status = waitChild(spawnChild(options.args, options.env, {{in, 0}, {out, 1}, {err, 2}}),
                             options.timeout);
@@ -196,8 +211,9 @@ std::string toolPath() {
 
 TempDir::TempDir() {
   std::string pattern = (std::filesystem::temp_directory_path() / "halvex-test-XXXXXX").string();
-  if (::mkdtemp(pattern.data()) == nullptr)
+  if (::mkdtemp(pattern.data()) == nullptr) {
     throw systemError("mkdtemp");
+  }
   path_ = pattern;
 }
 
@@ -215,8 +231,9 @@ void PrivateBus::launch(const std::string& listenAddress) {
   std::vector<std::string> args = {"/usr/bin/dbus-daemon",
                                    "--config-file=" HALVEX_PRIVATE_BUS_CONFIG, "--nofork",
                                    "--print-address=3"};
-  if (!listenAddress.empty())
+  if (!listenAddress.empty()) {
     args.push_back("--address=" + listenAddress);
+  }
   // dbus-daemon complains that it cannot raise its fd limit in a container: harmless, dropped.
   const std::string printed = startReporting(args, {}, "/dev/null", pid_);
   if (!printed.ends_with('\n')) {
@@ -279,19 +296,22 @@ SimProcess::~SimProcess() {
 std::vector<nlohmann::json> SimProcess::requestLog() const {
   std::vector<nlohmann::json> entries;
   std::ifstream in(dir_.path() / "requests.jsonl");
-  for (std::string line; std::getline(in, line);)
+  for (std::string line; std::getline(in, line);) {
     entries.push_back(nlohmann::json::parse(line));
+  }
   return entries;
 }
 
 void SimProcess::kill(int signal) {
-  if (pid_ >= 0)
+  if (pid_ >= 0) {
     ::kill(pid_, signal);
+  }
 }
 
 ExitStatus SimProcess::waitExit(std::chrono::milliseconds timeout) {
-  if (pid_ < 0)
+  if (pid_ < 0) {
     throw std::logic_error("SimProcess::waitExit called twice");
+  }
   return waitChild(std::exchange(pid_, -1), timeout);
 }
 

@@ -48,8 +48,6 @@ std::optional<std::string> LineEditor::readLine(std::string_view prompt) {
   line_ = LineBuffer();
   browsing_ = history_.size();
   edits_.clear();
-  search_.reset();
-  lastKey_.reset();
   if (!terminal_.enterRaw()) {
     return readPlain();
   }

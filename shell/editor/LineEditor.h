@@ -52,7 +52,8 @@ class LineEditor {
 
   // Shows prompt and edits one line until Enter; returns it without its line end, with the
   // terminal back in its normal mode. Nothing when input ends: Ctrl-D on an empty line, or the
-  // terminal reports an end or an error. Bytes that came after the line are kept for the next.
+  // terminal reports an end or an error; the editor is done then. Bytes that came after the line
+  // are kept for the next.
   std::optional<std::string> readLine(std::string_view prompt);
 
  private:

@@ -24,11 +24,15 @@ struct Session {
   std::string screen;
 };
 
-Session edit(const std::vector<std::string>& reads, int width = 80, bool refuseRaw = false) {
+Session edit(const std::vector<std::string>& reads, int width = 80, bool refuseRaw = false,
+             LineEditor::Completer completer = {}) {
   testing::FakeTerminal terminal(reads, width);
   terminal.refuseRaw = refuseRaw;
   const auto root = testing::makeToolTree();
-  LineEditor editor(terminal, [&](std::string_view before) { return completeWord(root, before); });
+  if (!completer) {
+    completer = [&](std::string_view before) { return completeWord(root, before); };
+  }
+  LineEditor editor(terminal, completer);
   Session session;
   while (std::optional<std::string> line = editor.readLine("> ")) {
     EXPECT_FALSE(terminal.raw) << "raw mode outlives the line";
@@ -61,6 +65,9 @@ TEST(LineEditorTest, KeysEditTheLine) {
        "fY\r",
        {"XoneY two"}},
       {"a-b\x1b[1;5DX\r", {"a-Xb"}},
+      {"ZZZ 9\x01\x1b"
+       "fX\r",
+       {"ZZZX 9"}},
       {"ab\x02\x02\x06X\x04\r", {"aX"}},
       // Characters, not bytes: multi-byte, wide, and a combining mark with its base.
       {"\xc3\xa9\xe6\x97\xa5\xe6\x9c\xac"
@@ -84,7 +91,7 @@ TEST(LineEditorTest, KeysEditTheLine) {
       {"ab\x1a"
        "c\r",
        {"abc"},
-       "<suspended>\r> ab"},
+       "\r\n<suspended>\r> ab"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.keys);
@@ -94,6 +101,10 @@ TEST(LineEditorTest, KeysEditTheLine) {
   }
   // A lone ESC, then a pause: the ESC does nothing and what follows is typed text.
   EXPECT_EQ(edit({"\x1b", "", "[A\r"}).lines, std::vector<std::string>{"[A"});
+  // Ctrl-C shows a fresh prompt at once, not only with the next key (Enter draws it again).
+  const std::string fresh = "\r> \x1b[K\r\x1b[2C";
+  EXPECT_NE(edit({"abc\x03", "\r"}).screen.find("^C\r\n" + fresh + fresh + "\r\n"),
+            std::string::npos);
 }
 
 TEST(LineEditorTest, HistoryAndSearchRecallLines) {
@@ -163,6 +174,12 @@ TEST(LineEditorTest, TabCompletesFromTheTree) {
     EXPECT_EQ(session.lines, std::vector<std::string>{c.line});
     EXPECT_NE(session.screen.find(c.shown), std::string::npos) << session.screen;
   }
+}
+
+TEST(LineEditorTest, CompletesOnlyWholeCharacters) {
+  // The candidates share the first byte of their first character, which is no start of its own.
+  const auto completer = [](std::string_view) { return Completion{0, {"\xc3\xa9x", "\xc3\xa8y"}}; };
+  EXPECT_EQ(edit({"\t\r"}, 80, false, completer).lines, std::vector<std::string>{""});
 }
 
 TEST(LineEditorTest, PastesEnterEachLineAndStayCheap) {

@@ -7,8 +7,8 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
-#include <cstring>
 #include <stdexcept>
+#include <system_error>
 #include <utility>
 #include <vector>
 
@@ -31,7 +31,7 @@ namespace {
 EventPtr newEventLoop() {
   sd_event* raw = nullptr;
   if (const int r = sd_event_new(&raw); r < 0) {
-    throw std::runtime_error(std::string("cannot create an event loop: ") + std::strerror(-r));
+    throw std::system_error(-r, std::generic_category(), "cannot create an event loop");
   }
   return EventPtr(raw);
 }
@@ -87,7 +87,7 @@ Daemon::Impl::Impl(const Scenario& scenario, DaemonOptions optionsIn)
   sigemptyset(&stops);
   sigaddset(&stops, SIGTERM);
   sigaddset(&stops, SIGINT);
-  sigprocmask(SIG_BLOCK, &stops, nullptr);
+  pthread_sigmask(SIG_BLOCK, &stops, nullptr);
   sd_event_add_signal(event.get(), nullptr, SIGTERM, nullptr, nullptr);
   sd_event_add_signal(event.get(), nullptr, SIGINT, nullptr, nullptr);
 

@@ -72,9 +72,7 @@ const sd_bus_vtable DeviceObject::kVtable[] = {
     SD_BUS_SIGNAL(bus::kDeviceIdentityChanged, "", 0), SD_BUS_VTABLE_END};
 
 DeviceObject::DeviceObject(Device identity, const Services& services)
-    : identity_(std::move(identity)),
-      services_(services),
-      endpoint_(kNames, kVtable, this, services) {}
+    : identity_(identity), services_(services), endpoint_(kNames, kVtable, this, services) {}
 
 int DeviceObject::change(const MessageDict& changes) {
   if (!endpoint_.owned()) {

@@ -4,8 +4,7 @@
 
 #include <cstdint>
 #include <cstdio>
-#include <cstring>
-#include <stdexcept>
+#include <system_error>
 #include <utility>
 
 namespace halvex::sim {
@@ -35,7 +34,7 @@ void Endpoint::connect() {
   sd_bus* raw = nullptr;
   int r = sd_bus_open_system(&raw);
   if (r < 0) {
-    throw std::runtime_error(std::string("cannot connect to the system bus: ") + std::strerror(-r));
+    throw std::system_error(-r, std::generic_category(), "cannot connect to the system bus");
   }
   bus_.reset(raw);
   sd_bus_slot* slot = nullptr;
@@ -50,7 +49,8 @@ void Endpoint::connect() {
   }
   nameSlot_.reset(slot);
   if (r < 0) {
-    throw std::runtime_error(std::string("cannot serve ") + names_.name + ": " + std::strerror(-r));
+    throw std::system_error(-r, std::generic_category(),
+                            std::string("cannot serve ") + names_.name);
   }
 }
 

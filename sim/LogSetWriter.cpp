@@ -62,6 +62,7 @@ bool fillFolder(const fs::path& folder, const std::string& name, std::string_vie
 // tar from PATH, with a clean signal mask: the daemon blocks SIGTERM for its event loop.
 bool runTar(const std::vector<std::string>& args) {
   std::vector<char*> argv;
+  argv.reserve(args.size() + 1);
   for (const auto& arg : args) {
     argv.push_back(const_cast<char*>(arg.c_str()));
   }
@@ -73,7 +74,7 @@ bool runTar(const std::vector<std::string>& args) {
   if (pid == 0) {
     sigset_t none;
     ::sigemptyset(&none);
-    ::sigprocmask(SIG_SETMASK, &none, nullptr);
+    ::pthread_sigmask(SIG_SETMASK, &none, nullptr);
     ::execvp(argv[0], argv.data());
     ::_exit(127);
   }

@@ -9,9 +9,8 @@
 
 #include <cerrno>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
-#include <stdexcept>
+#include <system_error>
 
 namespace halvex::sim {
 namespace {
@@ -36,8 +35,7 @@ void ProcessKeeper::start(const std::vector<std::string>& names) {
   }
   std::string dir = (std::filesystem::temp_directory_path() / "halvex-sim-XXXXXX").string();
   if (::mkdtemp(dir.data()) == nullptr) {
-    throw std::runtime_error(std::string("cannot create a folder for processes: ") +
-                             std::strerror(errno));
+    throw std::system_error(errno, std::generic_category(), "cannot create a folder for processes");
   }
   // The links matter only to exec, which has read them by the time it returns in the child; the
   // folder goes as soon as every process is started, so a killed simulator leaves nothing behind.
@@ -50,21 +48,21 @@ void ProcessKeeper::start(const std::vector<std::string>& names) {
   } remove{dir};
   const pid_t self = ::getpid();
   for (const std::string& name : names) {
-    const std::string link = dir + "/" + name;
+    const std::string link = (std::filesystem::path(dir) / name).string();
     if (::symlink(kSleep, link.c_str()) != 0) {
-      throw std::runtime_error("cannot link " + link + ": " + std::strerror(errno));
+      throw std::system_error(errno, std::generic_category(), "cannot link " + link);
     }
     // An exec failure is reported through a pipe that a successful exec closes.
     int report[2];
     if (::pipe2(report, O_CLOEXEC) != 0) {
-      throw std::runtime_error(std::string("pipe2: ") + std::strerror(errno));
+      throw std::system_error(errno, std::generic_category(), "pipe2");
     }
     const pid_t pid = ::fork();
     if (pid < 0) {
       const int error = errno;
       ::close(report[0]);
       ::close(report[1]);
-      throw std::runtime_error(std::string("fork: ") + std::strerror(error));
+      throw std::system_error(error, std::generic_category(), "fork");
     }
     if (pid == 0) {
       // Die with the simulator however it ends; the check covers a parent already gone.
@@ -74,7 +72,7 @@ void ProcessKeeper::start(const std::vector<std::string>& names) {
       }
       sigset_t none;
       ::sigemptyset(&none);
-      ::sigprocmask(SIG_SETMASK, &none, nullptr);
+      ::pthread_sigmask(SIG_SETMASK, &none, nullptr);
       char infinity[] = "infinity";
       char* argv[] = {const_cast<char*>(link.c_str()), infinity, nullptr};
       ::execv(link.c_str(), argv);
@@ -90,7 +88,7 @@ void ProcessKeeper::start(const std::vector<std::string>& names) {
     }
     ::close(report[0]);
     if (got == static_cast<ssize_t>(sizeof error)) {
-      throw std::runtime_error("cannot start process " + name + ": " + std::strerror(error));
+      throw std::system_error(error, std::generic_category(), "cannot start process " + name);
     }
   }
 }

@@ -5,8 +5,8 @@
 #include <unistd.h>
 
 #include <cstdio>
-#include <cstring>
 #include <ctime>
+#include <system_error>
 #include <utility>
 
 #include "platform/SystemLog.h"
@@ -143,8 +143,9 @@ void Replier::send(const Endpoint& endpoint, sd_bus_message* call, const Reply& 
     r = sd_bus_send(nullptr, raw, nullptr);
   }
   if (r < 0) {
-    std::fprintf(stderr, "halvex-sim: cannot send a reply: %s\n", std::strerror(-r));
-    endpoint.journal().log(LogLevel::kError, entry + ", not sent: " + std::strerror(-r));
+    const std::string reason = std::generic_category().message(-r);
+    std::fprintf(stderr, "halvex-sim: cannot send a reply: %s\n", reason.c_str());
+    endpoint.journal().log(LogLevel::kError, entry + ", not sent: " + reason);
     return;
   }
   endpoint.journal().log(LogLevel::kInfo, entry);

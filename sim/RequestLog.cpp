@@ -5,8 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
-#include <stdexcept>
+#include <system_error>
 
 namespace halvex::sim {
 namespace {
@@ -45,7 +44,7 @@ RequestLog::RequestLog(const std::string& path) {
   }
   fd_ = ::open(path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
   if (fd_ < 0) {
-    throw std::runtime_error(path + ": cannot open the request log: " + std::strerror(errno));
+    throw std::system_error(errno, std::generic_category(), path + ": cannot open the request log");
   }
 }
 

@@ -7,9 +7,9 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <limits>
 #include <set>
+#include <system_error>
 
 #include "platform/ServerProtocol.h"
 #include "platform/linux/MessageCodec.h"
@@ -330,7 +330,7 @@ Scenario parseScenario(std::string_view text) {
 
 Scenario loadScenario(const std::string& path) {
   const auto unreadable = [&path](int error) {
-    return std::runtime_error(path + ": cannot be read: " + std::strerror(error));
+    return std::system_error(error, std::generic_category(), path + ": cannot be read");
   };
   const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
   if (fd < 0) {

@@ -3,9 +3,8 @@
 // otherwise, none for a request that is only kept.
 #include "sim/Scheduler.h"
 
-#include <cstring>
 #include <ctime>
-#include <stdexcept>
+#include <system_error>
 #include <utility>
 
 namespace halvex::sim {
@@ -37,7 +36,7 @@ Scheduler::Work* Scheduler::after(const Endpoint* owner, std::uint32_t delayMs,
                           1000U, &Scheduler::onTimer, raw);
   }
   if (r < 0) {
-    throw std::runtime_error(std::string("cannot schedule: ") + std::strerror(-r));
+    throw std::system_error(-r, std::generic_category(), "cannot schedule");
   }
   raw->source.reset(source);
   work_.push_back(std::move(item));

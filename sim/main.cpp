@@ -85,6 +85,7 @@ int main(int argc, char** argv) {
   // Our own messages, one line each; "+" stops at the first word that is not an option.
   opterr = 0;
   int id = 0;
+  // NOLINTNEXTLINE(concurrency-mt-unsafe), see .clang-tidy
   while ((id = getopt_long(argc, argv, "+:hV", kOptions, nullptr)) != -1) {
     switch (id) {
       case 'h': std::fputs(kUsage, stdout); return 0;

@@ -72,7 +72,7 @@ TEST(DeviceIdentityTest, KeptOnlyWhenAnswered) {
 class DeviceService {
  public:
   explicit DeviceService(std::int64_t radioType, std::uint64_t nameFlags = 0)
-      : radio(radioType), thread_([this, nameFlags](std::stop_token stop) {
+      : radio(radioType), thread_([this, nameFlags](const std::stop_token& stop) {
           sd_bus* bus = nullptr;
           const bool ok =
               sd_bus_open_system(&bus) >= 0 &&
@@ -189,16 +189,19 @@ TEST(LeakTest, RepeatedWorkLeavesNothingBehind) {
     for (int i = 0; i < 20; ++i) {
       auto manager = client::CreateManager("halvextool", queue);
       auto stated = std::make_shared<std::promise<void>>();
-      client::RegisterEventHandler(manager, kEventServerStateChange,
-                                   [stated](MessageValue, TaskGroup) { stated->set_value(); });
+      client::RegisterEventHandler(
+          manager, kEventServerStateChange,
+          [stated](const MessageValue&, TaskGroup) { stated->set_value(); });
       client::EventsOn(manager);
       ASSERT_EQ(stated->get_future().wait_for(std::chrono::seconds(5)), std::future_status::ready);
       MessageValue reply;
       EXPECT_TRUE(client::PerformCommand(manager, kCommandTraceDumpState, {}, reply).ok());
       std::promise<Result> answered;
-      client::PerformCommand(
-          manager, kCommandTraceDumpState,
-          [&answered](Result result, MessageValue) { answered.set_value(result); }, {});
+      client::PerformCommand(manager, kCommandTraceDumpState,
+                             [&answered](Result result, const MessageValue&) {
+                               answered.set_value(std::move(result));
+                             },
+                             {});
       EXPECT_TRUE(answered.get_future().get().ok());
       EXPECT_TRUE(HelperClient::create("logdump.helper", nullptr)
                       ->perform(helper::kTaskDiagnosticsCollection, helper::kCommandVarniskStatus,
@@ -310,8 +313,8 @@ TEST(DevicePropertyTest, BootArgumentsAreTheKernelCommandLine) {
   TempDir dir;
   const fs::path fake = dir.path() / "cmdline";
   const std::pair<std::string, std::string> cases[] = {
-      {std::string(70000, 'a'), std::string(64 * 1024, 'a')},
-      {std::string("quiet x=1\n\0\n", 13), "quiet x=1"},
+      {std::string(70000, 'a'), std::string(std::size_t{64} * 1024, 'a')},
+      {std::string("quiet x=1\n\0\n\0", 13), "quiet x=1"},
   };
   for (const auto& [content, expected] : cases) {
     std::ofstream(fake, std::ios::binary) << content;
@@ -398,9 +401,9 @@ TEST(SystemLogTest, EveryRequestIsLoggedWithItsOutcome) {
     EXPECT_EQ(fields["SYSLOG_IDENTIFIER"], program_invocation_short_name);
   }
   // A runaway message is cut, not sent whole.
-  server->write(context, LogLevel::kError, std::string(100 * 1024, 'x'));
+  server->write(context, LogLevel::kError, std::string(std::size_t{100} * 1024, 'x'));
   EXPECT_EQ(journal.receive("org.halvex.test", "journal-test")["MESSAGE"],
-            std::string(16 * 1024, 'x'));
+            std::string(std::size_t{16} * 1024, 'x'));
 
   // Before any thread starts: a bus that cannot be reached reads as no radio, and says why.
   ASSERT_EQ(setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/bus", 1), 0);

@@ -54,12 +54,14 @@ class ManagerTest : public ::testing::Test {
     mail_.push_back(std::move(delivery));
     changed_.notify_all();
   }
-  client::Completion record(std::string tag) {
-    return [this, tag](Result result, MessageValue reply) { add({tag, result, reply}); };
+  client::Completion record(const std::string& tag) {
+    return [this, tag](Result result, MessageValue reply) {
+      add({tag, std::move(result), std::move(reply)});
+    };
   }
   void listen(const std::string& event) {
     client::RegisterEventHandler(manager_, event, [this, event](MessageValue payload, TaskGroup) {
-      add({event, {}, payload});
+      add({event, {}, std::move(payload)});
     });
   }
 
@@ -165,7 +167,7 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
   client::PerformCommand(manager_, "Bad\xff", record("unsendable"), {});
   client::PerformCommand(
       manager_, "Unlisted",
-      [this](Result, MessageValue) {  // the queue waits, the run loop does not
+      [this](const Result&, const MessageValue&) {  // the queue waits, the run loop does not
         MessageValue inner;
         add({"nested", client::PerformCommand(manager_, kCommandTraceDumpState, {}, inner), inner});
       },
@@ -262,7 +264,7 @@ class RogueServer {
     return sd_bus_reply_method_errorf(call, SD_BUS_ERROR_SERVICE_UNKNOWN, "not me");
   }
   std::promise<bool> ready_;
-  std::jthread thread_{[this](std::stop_token stop) {
+  std::jthread thread_{[this](const std::stop_token& stop) {
     sd_bus* bus = nullptr;
     bool ok = sd_bus_open_system(&bus) >= 0 &&
               sd_bus_add_object(bus, nullptr, "/org/halvex/Server", &answer, nullptr) >= 0 &&
@@ -331,8 +333,8 @@ TEST_F(ManagerTest, PendingCallsAreBoundedAndEachCompletesOnceWhenTheManagerGoes
   // Here the completion holds the last reference, so the manager goes on the queue itself.
   auto last = client::CreateManager("halvextool", *queue_);
   client::PerformCommand(last, "Any",
-                         [this, keep = last](Result result, MessageValue) {
-                           add({"last", result, {}});
+                         [this, keep = last](Result result, const MessageValue&) {
+                           add({"last", std::move(result), {}});
                          },
                          {});
   last.reset();
@@ -343,13 +345,14 @@ TEST_F(ManagerTest, PendingCallsAreBoundedAndEachCompletesOnceWhenTheManagerGoes
 TEST_F(ManagerTest, ManyThreadsShareOneManager) {
   start("{}");
   listen(kEventServerStateChange);
-  constexpr int kThreads = 4, kCalls = 40;
+  constexpr std::size_t kThreads = 4, kCalls = 40;
   std::atomic<int> failures{0};
   {
     std::vector<std::jthread> callers;
-    for (int t = 0; t < kThreads; ++t) {
+    callers.reserve(kThreads);
+    for (std::size_t t = 0; t < kThreads; ++t) {
       callers.emplace_back([&, t] {
-        for (int i = 0; i < kCalls; ++i) {
+        for (std::size_t i = 0; i < kCalls; ++i) {
           MessageValue reply;
           failures += !client::PerformCommand(manager_, "Sync", sampleRequest(), reply).ok();
           client::PerformCommand(manager_, "Async", record("async"), sampleRequest());
@@ -361,7 +364,7 @@ TEST_F(ManagerTest, ManyThreadsShareOneManager) {
   }
   EXPECT_EQ(failures.load(), 0);
   ASSERT_TRUE(waitFor(kThreads * kCalls, "async") && drain());
-  EXPECT_EQ(mail("async").size(), static_cast<std::size_t>(kThreads * kCalls));
+  EXPECT_EQ(mail("async").size(), kThreads * kCalls);
   for (const Delivery& done : mail("async")) {
     EXPECT_TRUE(done.result.ok() && done.onQueue) << done.result.message;
   }

@@ -31,6 +31,7 @@ std::runtime_error systemError(const std::string& what, int error = errno) {
 
 std::vector<char*> pointers(const std::vector<std::string>& strings) {
   std::vector<char*> result;
+  result.reserve(strings.size() + 1);
   for (const auto& s : strings) {
     result.push_back(const_cast<char*>(s.c_str()));
   }
@@ -118,10 +119,38 @@ std::string program(const char* path, const char* name) {
   return path;
 }
 
-void terminate(pid_t& pid) {
+// Waits for pid to end, killing it once timeout has passed; false, with errno, when pid is
+// not a child to wait for.
+bool reap(pid_t pid, std::chrono::milliseconds timeout, ExitStatus& status) noexcept {
+  int raw = 0;
+  pid_t done;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  // A pidfd would let us sleep exactly until the exit; the kernel may refuse one in a container,
+  // and a few milliseconds of latency do not matter to a test.
+  while ((done = ::waitpid(pid, &raw, WNOHANG)) == 0 || (done < 0 && errno == EINTR)) {
+    if (std::chrono::steady_clock::now() >= deadline) {
+      ::kill(pid, SIGKILL);
+      done = ::waitpid(pid, &raw, 0);
+      status.timedOut = true;
+      break;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  if (done != pid) {
+    return false;
+  }
+  status.exited = WIFEXITED(raw);
+  status.code = status.exited ? WEXITSTATUS(raw) : -1;
+  status.signal = WIFSIGNALED(raw) ? WTERMSIG(raw) : 0;
+  return true;
+}
+
+// For destructors: a child that cannot be waited for has been reaped already.
+void terminate(pid_t& pid) noexcept {
   if (pid >= 0) {
     ::kill(pid, SIGTERM);
-    waitChild(std::exchange(pid, -1), std::chrono::seconds(5));
+    ExitStatus ignored;
+    reap(std::exchange(pid, -1), std::chrono::seconds(5), ignored);
   }
 }
 
@@ -162,26 +191,9 @@ pid_t spawnChild(const std::vector<std::string>& args, const EnvChanges& env,
 
 ExitStatus waitChild(pid_t pid, std::chrono::milliseconds timeout) {
   ExitStatus status;
-  int raw = 0;
-  pid_t done;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  // A pidfd would let us sleep exactly until the exit; the kernel may refuse one in a container,
-  // and a few milliseconds of latency do not matter to a test.
-  while ((done = ::waitpid(pid, &raw, WNOHANG)) == 0 || (done < 0 && errno == EINTR)) {
-    if (std::chrono::steady_clock::now() >= deadline) {
-      ::kill(pid, SIGKILL);
-      done = ::waitpid(pid, &raw, 0);
-      status.timedOut = true;
-      break;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  if (done != pid) {
+  if (!reap(pid, timeout, status)) {
     throw systemError("waitpid");
   }
-  status.exited = WIFEXITED(raw);
-  status.code = status.exited ? WEXITSTATUS(raw) : -1;
-  status.signal = WIFSIGNALED(raw) ? WTERMSIG(raw) : 0;
   return status;
 }
 

@@ -10,11 +10,11 @@
 #include <cstdio>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/RunLoop.h"
 #include "platform/ServerClient.h"
 #include "platform/linux/BusProtocol.h"
@@ -88,19 +88,18 @@ void BM_AsyncPerform(benchmark::State& state) {
   const MessageDict request = sampleRequest();
   // Shared with the completion, which may still be notifying when the last iteration's wait ends.
   struct Handoff {
-    std::mutex mutex;
+    Mutex mutex;
     std::condition_variable done;
-    bool finished = false;
-    Result last;
+    bool finished GUARDED_BY(mutex) = false;
+    Result last GUARDED_BY(mutex);
   };
   auto handoff = std::make_shared<Handoff>();
   for (auto _ : state) {
-    handoff->finished = false;
     client::PerformCommand(
         manager, kCommand,
         [handoff](Result result, const MessageValue&) {
           {
-            std::lock_guard lock(handoff->mutex);
+            MutexLock lock(handoff->mutex);
             handoff->last = std::move(result);
             handoff->finished = true;
           }
@@ -109,8 +108,11 @@ void BM_AsyncPerform(benchmark::State& state) {
           handoff->done.notify_one();
         },
         request);
-    std::unique_lock lock(handoff->mutex);
-    handoff->done.wait(lock, [&] { return handoff->finished; });
+    MutexLock lock(handoff->mutex);
+    while (!handoff->finished) {
+      lock.wait(handoff->done);
+    }
+    handoff->finished = false;
     if (!handoff->last.ok()) {
       state.SkipWithError(handoff->last.message.c_str());
       return;

@@ -8,8 +8,10 @@ function(halvex_warnings target)
     -Woverloaded-virtual -Wconversion -Wsign-conversion -Wimplicit-fallthrough)
   # sd-bus's public initialisers (SD_BUS_ERROR_NULL and friends) are C compound literals, which
   # clang's pedantic mode reports in C++ wherever they are used.
+  # Clang checks the locks against what they guard (platform/Mutex.h).
   if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
-    target_compile_options(${target} PRIVATE -Wno-c99-extensions)
+    target_compile_options(${target} PRIVATE -Wno-c99-extensions -Wthread-safety
+      -Wthread-safety-beta)
   endif()
   if(HALVEX_WERROR)
     target_compile_options(${target} PRIVATE -Werror)

@@ -5,20 +5,21 @@
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
-#include <mutex>
+
+#include "platform/Mutex.h"
 
 namespace halvex {
 
 struct TaskGroup::State {
-  std::mutex mutex;
+  Mutex mutex;
   std::condition_variable drained;
-  long count = 0;
+  long count GUARDED_BY(mutex) = 0;
 };
 
 TaskGroup::TaskGroup() : state_(std::make_shared<State>()) {}
 
 void TaskGroup::enter() const {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   ++state_->count;
 }
 
@@ -27,7 +28,7 @@ void TaskGroup::leave() const {
   // may be nothing but a reference to the waiter's own.
   const std::shared_ptr<State> state = state_;
   {
-    std::lock_guard lock(state->mutex);
+    MutexLock lock(state->mutex);
     if (state->count == 0) {
       std::fputs("TaskGroup: leave() without a matching enter()\n", stderr);
       std::abort();
@@ -41,13 +42,21 @@ void TaskGroup::leave() const {
 }
 
 void TaskGroup::wait() const {
-  std::unique_lock lock(state_->mutex);
-  state_->drained.wait(lock, [this] { return state_->count == 0; });
+  MutexLock lock(state_->mutex);
+  while (state_->count != 0) {
+    lock.wait(state_->drained);
+  }
 }
 
 bool TaskGroup::waitFor(std::chrono::milliseconds timeout) const {
-  std::unique_lock lock(state_->mutex);
-  return state_->drained.wait_for(lock, timeout, [this] { return state_->count == 0; });
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  MutexLock lock(state_->mutex);
+  while (state_->count != 0) {
+    if (!lock.waitUntil(state_->drained, deadline)) {
+      return state_->count == 0;
+    }
+  }
+  return true;
 }
 
 TaskGroupHold::TaskGroupHold(TaskGroup group) : group_(std::make_unique<TaskGroup>(group)) {

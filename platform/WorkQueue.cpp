@@ -6,8 +6,9 @@
 
 #include <condition_variable>
 #include <deque>
-#include <mutex>
 #include <thread>
+
+#include "platform/Mutex.h"
 
 namespace halvex {
 
@@ -16,18 +17,20 @@ namespace {
 // Shared by the handles' Impl and the worker thread, so that a worker whose Impl is gone can
 // still drain what was posted.
 struct Shared {
-  std::mutex mutex;
+  Mutex mutex;
   std::condition_variable ready;
-  std::deque<WorkQueue::Closure> pending;
-  bool closed = false;
+  std::deque<WorkQueue::Closure> pending GUARDED_BY(mutex);
+  bool closed GUARDED_BY(mutex) = false;
 };
 
 void drain(const std::shared_ptr<Shared>& shared) {
   for (;;) {
     WorkQueue::Closure next;
     {
-      std::unique_lock lock(shared->mutex);
-      shared->ready.wait(lock, [&] { return shared->closed || !shared->pending.empty(); });
+      MutexLock lock(shared->mutex);
+      while (!shared->closed && shared->pending.empty()) {
+        lock.wait(shared->ready);
+      }
       if (shared->pending.empty()) {
         return;
       }
@@ -51,7 +54,7 @@ class WorkQueue::Impl {
 
   ~Impl() {
     {
-      std::lock_guard lock(shared_->mutex);
+      MutexLock lock(shared_->mutex);
       shared_->closed = true;
     }
     shared_->ready.notify_one();
@@ -72,7 +75,7 @@ class WorkQueue::Impl {
       return;
     }
     {
-      std::lock_guard lock(shared_->mutex);
+      MutexLock lock(shared_->mutex);
       shared_->pending.push_back(std::move(closure));
     }
     shared_->ready.notify_one();

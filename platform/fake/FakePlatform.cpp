@@ -4,12 +4,12 @@
 #include <algorithm>
 #include <cstdint>
 #include <iterator>
-#include <mutex>
 #include <utility>
 
 #include "platform/DevicePropertyService.h"
 #include "platform/DeviceQueries.h"
 #include "platform/HelperClient.h"
+#include "platform/Mutex.h"
 #include "platform/RunLoop.h"
 #include "platform/ServerClient.h"
 
@@ -22,18 +22,19 @@ class Manager {
 
   const std::string client;
   const WorkQueue queue;
-  // Guarded by the platform's mutex.
-  std::map<std::string, EventHandler> handlers;
-  bool eventsOn = false;
+  // Taken after the platform's, when both are.
+  Mutex mutex;
+  std::map<std::string, EventHandler> handlers GUARDED_BY(mutex);
+  bool eventsOn GUARDED_BY(mutex) = false;
   // Bumped by EventsOff so that events already posted to the queue are dropped.
-  std::uint64_t generation = 0;
+  std::uint64_t generation GUARDED_BY(mutex) = 0;
 };
 
 }  // namespace halvex::client
 
 namespace halvex::fake {
 
-// Everything reset() puts back to its start. Not in an anonymous namespace: Impl derives from it.
+// Everything reset() puts back to its start.
 struct FakeState {
   Device device;
   std::vector<std::string> calls;
@@ -50,35 +51,37 @@ struct FakeState {
   std::vector<std::shared_ptr<client::Manager>> managers;
 };
 
-struct FakePlatform::Impl : FakeState {
-  mutable std::mutex mutex;
+struct FakePlatform::Impl {
+  mutable Mutex mutex;
+  FakeState state GUARDED_BY(mutex);
   // Managers from before the last reset(). A manager lives as long as the process, as with the
   // real framework, which keeps each one reachable from its registered handlers.
-  std::vector<std::shared_ptr<client::Manager>> retired;
+  std::vector<std::shared_ptr<client::Manager>> retired GUARDED_BY(mutex);
 
-  void record(std::string entry) {
-    std::lock_guard lock(mutex);
-    calls.push_back(std::move(entry));
+  void record(std::string entry) EXCLUDES(mutex) {
+    MutexLock lock(mutex);
+    state.calls.push_back(std::move(entry));
   }
 
   template <typename T>
-  T read(T Device::*field, const char* name) {
-    std::lock_guard lock(mutex);
-    calls.emplace_back(name);
-    return device.*field;
+  T read(T Device::*field, const char* name) EXCLUDES(mutex) {
+    MutexLock lock(mutex);
+    state.calls.emplace_back(name);
+    return state.device.*field;
   }
 
-  // Posts handler(payload) for event to manager's queue; the caller holds the mutex.
-  void postEventLocked(const std::shared_ptr<client::Manager>& manager, const std::string& event,
-                       const MessageValue& payload) {
+  // Posts handler(payload) for event to manager's queue.
+  static void postEventLocked(const std::shared_ptr<client::Manager>& manager,
+                              const std::string& event, const MessageValue& payload)
+      REQUIRES(manager->mutex) {
     auto found = manager->handlers.find(event);
     if (found == manager->handlers.end()) {
       return;
     }
     manager->queue.post(
-        [this, manager, handler = found->second, payload, generation = manager->generation] {
+        [manager, handler = found->second, payload, generation = manager->generation] {
           {
-            std::lock_guard lock(mutex);
+            MutexLock lock(manager->mutex);
             if (!manager->eventsOn || manager->generation != generation) {
               return;
             }
@@ -107,8 +110,8 @@ FakePlatform& FakePlatform::get() {
 void FakePlatform::reset() {
   FakeState old;
   {
-    std::lock_guard lock(impl_->mutex);
-    old = std::exchange(static_cast<FakeState&>(*impl_), FakeState());
+    MutexLock lock(impl_->mutex);
+    old = std::exchange(impl_->state, FakeState());
     std::move(old.managers.begin(), old.managers.end(), std::back_inserter(impl_->retired));
   }
   // The old closures and queues go here, outside the lock their threads may take.
@@ -119,51 +122,53 @@ FakePlatform::Impl& FakePlatform::impl() {
 }
 
 void FakePlatform::setDevice(Device device) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->device = std::move(device);
+  MutexLock lock(impl_->mutex);
+  impl_->state.device = std::move(device);
 }
 
 Device FakePlatform::device() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->device;
+  MutexLock lock(impl_->mutex);
+  return impl_->state.device;
 }
 
 std::vector<std::string> FakePlatform::calls() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->calls;
+  MutexLock lock(impl_->mutex);
+  return impl_->state.calls;
 }
 
 std::size_t FakePlatform::count(std::string_view entry) const {
-  std::lock_guard lock(impl_->mutex);
-  return static_cast<std::size_t>(std::count(impl_->calls.begin(), impl_->calls.end(), entry));
+  MutexLock lock(impl_->mutex);
+  return static_cast<std::size_t>(
+      std::count(impl_->state.calls.begin(), impl_->state.calls.end(), entry));
 }
 
 void FakePlatform::clearCalls() {
-  std::lock_guard lock(impl_->mutex);
-  impl_->calls.clear();
+  MutexLock lock(impl_->mutex);
+  impl_->state.calls.clear();
 }
 
 void FakePlatform::setServerResponder(ServerResponder responder) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->serverResponder = std::move(responder);
+  MutexLock lock(impl_->mutex);
+  impl_->state.serverResponder = std::move(responder);
 }
 
 std::vector<ServerRequest> FakePlatform::serverRequests() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->serverRequests;
+  MutexLock lock(impl_->mutex);
+  return impl_->state.serverRequests;
 }
 
 void FakePlatform::setEventsOnDelivery(std::vector<std::pair<std::string, MessageValue>> events) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->eventsOnDelivery = std::move(events);
+  MutexLock lock(impl_->mutex);
+  impl_->state.eventsOnDelivery = std::move(events);
 }
 
 std::size_t FakePlatform::deliverEvent(const std::string& event, const MessageValue& payload) {
-  std::lock_guard lock(impl_->mutex);
+  MutexLock lock(impl_->mutex);
   std::size_t posted = 0;
-  for (const auto& manager : impl_->managers) {
+  for (const auto& manager : impl_->state.managers) {
+    MutexLock managerLock(manager->mutex);
     if (manager->eventsOn && manager->handlers.count(event) != 0) {
-      impl_->postEventLocked(manager, event, payload);
+      Impl::postEventLocked(manager, event, payload);
       ++posted;
     }
   }
@@ -171,15 +176,15 @@ std::size_t FakePlatform::deliverEvent(const std::string& event, const MessageVa
 }
 
 void FakePlatform::holdCompletions(bool hold) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->holding = hold;
+  MutexLock lock(impl_->mutex);
+  impl_->state.holding = hold;
 }
 
 std::size_t FakePlatform::releaseCompletions() {
   std::vector<std::pair<WorkQueue, WorkQueue::Closure>> held;
   {
-    std::lock_guard lock(impl_->mutex);
-    held.swap(impl_->heldCompletions);
+    MutexLock lock(impl_->mutex);
+    held.swap(impl_->state.heldCompletions);
   }
   for (auto& [queue, closure] : held) {
     queue.post(std::move(closure));
@@ -188,30 +193,30 @@ std::size_t FakePlatform::releaseCompletions() {
 }
 
 void FakePlatform::setHelperResponder(HelperResponder responder) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->helperResponder = std::move(responder);
+  MutexLock lock(impl_->mutex);
+  impl_->state.helperResponder = std::move(responder);
 }
 
 void FakePlatform::setHelperCreatable(bool creatable) {
-  std::lock_guard lock(impl_->mutex);
-  impl_->helperCreatable = creatable;
+  MutexLock lock(impl_->mutex);
+  impl_->state.helperCreatable = creatable;
 }
 
 std::vector<HelperRequest> FakePlatform::helperRequests() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->helperRequests;
+  MutexLock lock(impl_->mutex);
+  return impl_->state.helperRequests;
 }
 
 std::vector<LogLine> FakePlatform::logLines() const {
-  std::lock_guard lock(impl_->mutex);
-  return impl_->logLines;
+  MutexLock lock(impl_->mutex);
+  return impl_->state.logLines;
 }
 
 void FakePlatform::clearRequests() {
-  std::lock_guard lock(impl_->mutex);
-  impl_->serverRequests.clear();
-  impl_->helperRequests.clear();
-  impl_->logLines.clear();
+  MutexLock lock(impl_->mutex);
+  impl_->state.serverRequests.clear();
+  impl_->state.helperRequests.clear();
+  impl_->state.logLines.clear();
 }
 
 }  // namespace halvex::fake
@@ -252,9 +257,9 @@ bool isTraceAllowed() {
 
 bool isProcessRunning(const std::string& name) {
   auto& impl = fakeImpl();
-  std::lock_guard lock(impl.mutex);
-  impl.calls.push_back("isProcessRunning:" + name);
-  return impl.device.runningProcesses.count(name) != 0;
+  MutexLock lock(impl.mutex);
+  impl.state.calls.push_back("isProcessRunning:" + name);
+  return impl.state.device.runningProcesses.count(name) != 0;
 }
 
 std::string getProgramName() {
@@ -278,8 +283,9 @@ class FakeLogServer final : public LogServer {
  public:
   void write(const LogContext& context, LogLevel level, std::string_view message) override {
     auto& impl = fakeImpl();
-    std::lock_guard lock(impl.mutex);
-    impl.logLines.push_back({context.subsystem(), context.category(), level, std::string(message)});
+    MutexLock lock(impl.mutex);
+    impl.state.logLines.push_back(
+        {context.subsystem(), context.category(), level, std::string(message)});
   }
 };
 
@@ -292,10 +298,10 @@ class FakeHelperClient final : public HelperClient {
     auto& impl = fakeImpl();
     fake::FakePlatform::HelperResponder responder;
     {
-      std::lock_guard lock(impl.mutex);
-      impl.calls.push_back(std::string("HelperClient::perform:") + command);
-      impl.helperRequests.push_back({service_, task, command, request});
-      responder = impl.helperResponder;
+      MutexLock lock(impl.mutex);
+      impl.state.calls.push_back(std::string("HelperClient::perform:") + command);
+      impl.state.helperRequests.push_back({service_, task, command, request});
+      responder = impl.state.helperResponder;
     }
     fake::Answer answer = responder ? responder(task, command, request) : fake::notRunning();
     if (answer.result.ok()) {
@@ -323,9 +329,9 @@ std::shared_ptr<LogServer> LogServer::create() {
 std::shared_ptr<HelperClient> HelperClient::create(const char* serviceName,
                                                    std::shared_ptr<LogServer> /*logger*/) {
   auto& impl = fakeImpl();
-  std::lock_guard lock(impl.mutex);
-  impl.calls.push_back(std::string("HelperClient::create:") + serviceName);
-  if (!impl.helperCreatable) {
+  MutexLock lock(impl.mutex);
+  impl.state.calls.push_back(std::string("HelperClient::create:") + serviceName);
+  if (!impl.state.helperCreatable) {
     return nullptr;
   }
   return std::make_shared<FakeHelperClient>(serviceName);
@@ -338,35 +344,38 @@ namespace halvex::client {
 std::shared_ptr<Manager> CreateManager(const std::string& clientName, WorkQueue queue) {
   auto& impl = fakeImpl();
   auto manager = std::make_shared<Manager>(clientName, std::move(queue));
-  std::lock_guard lock(impl.mutex);
-  impl.calls.push_back("CreateManager:" + clientName);
-  impl.managers.push_back(manager);
+  MutexLock lock(impl.mutex);
+  impl.state.calls.push_back("CreateManager:" + clientName);
+  impl.state.managers.push_back(manager);
   return manager;
 }
 
 void RegisterEventHandler(const std::shared_ptr<Manager>& manager, const std::string& event,
                           EventHandler handler) {
   auto& impl = fakeImpl();
-  std::lock_guard lock(impl.mutex);
-  impl.calls.push_back("RegisterEventHandler:" + event);
+  MutexLock lock(impl.mutex);
+  impl.state.calls.push_back("RegisterEventHandler:" + event);
+  MutexLock managerLock(manager->mutex);
   manager->handlers[event] = std::move(handler);
 }
 
 void EventsOff(const std::shared_ptr<Manager>& manager) {
   auto& impl = fakeImpl();
-  std::lock_guard lock(impl.mutex);
-  impl.calls.emplace_back("EventsOff");
+  MutexLock lock(impl.mutex);
+  impl.state.calls.emplace_back("EventsOff");
+  MutexLock managerLock(manager->mutex);
   manager->eventsOn = false;
   ++manager->generation;
 }
 
 void EventsOn(const std::shared_ptr<Manager>& manager) {
   auto& impl = fakeImpl();
-  std::lock_guard lock(impl.mutex);
-  impl.calls.emplace_back("EventsOn");
+  MutexLock lock(impl.mutex);
+  impl.state.calls.emplace_back("EventsOn");
+  MutexLock managerLock(manager->mutex);
   manager->eventsOn = true;
-  for (const auto& [event, payload] : impl.eventsOnDelivery) {
-    impl.postEventLocked(manager, event, payload);
+  for (const auto& [event, payload] : impl.state.eventsOnDelivery) {
+    fake::FakePlatform::Impl::postEventLocked(manager, event, payload);
   }
 }
 
@@ -377,10 +386,10 @@ fake::Answer answerServer(const std::shared_ptr<Manager>& manager, const std::st
   auto& impl = fakeImpl();
   fake::FakePlatform::ServerResponder responder;
   {
-    std::lock_guard lock(impl.mutex);
-    impl.calls.push_back("PerformCommand:" + command);
-    impl.serverRequests.push_back({manager->client, command, request, asynchronous});
-    responder = impl.serverResponder;
+    MutexLock lock(impl.mutex);
+    impl.state.calls.push_back("PerformCommand:" + command);
+    impl.state.serverRequests.push_back({manager->client, command, request, asynchronous});
+    responder = impl.state.serverResponder;
   }
   return responder ? responder(command, request) : fake::notRunning();
 }
@@ -403,9 +412,9 @@ void PerformCommand(const std::shared_ptr<Manager>& manager, const std::string& 
   };
   auto& impl = fakeImpl();
   {
-    std::lock_guard lock(impl.mutex);
-    if (impl.holding) {
-      impl.heldCompletions.emplace_back(manager->queue, std::move(deliver));
+    MutexLock lock(impl.mutex);
+    if (impl.state.holding) {
+      impl.state.heldCompletions.emplace_back(manager->queue, std::move(deliver));
       return;
     }
   }

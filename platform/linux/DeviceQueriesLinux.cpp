@@ -6,7 +6,6 @@
 #include <cstdint>
 #include <limits>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 
@@ -14,6 +13,7 @@
 #include "detail/CallBounds.h"
 #include "detail/ProcessBus.h"
 #include "platform/DeviceQueries.h"
+#include "platform/Mutex.h"
 #include "platform/linux/MessageCodec.h"
 
 namespace halvex::device {
@@ -27,12 +27,12 @@ const std::shared_ptr<IdentityCache>& identityCache();
 
 class IdentityCache final : public bus::ConnectionListener {
  public:
-  MessageDict get() {
+  MessageDict get() EXCLUDES(mutex_) {
     ProcessBus& processBus = ProcessBus::instance();
     // With no loop reading the connection, a change signalled already may still wait in it.
     processBus.catchUp();
     // Held across the question, so that concurrent first callers make one between them.
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // Read before asking: a change signalled while the question is out makes the next one ask
     // again.
     const std::uint64_t generation = generation_.load();
@@ -95,9 +95,9 @@ class IdentityCache final : public bus::ConnectionListener {
     return 0;
   }
 
-  std::mutex mutex_;
-  std::optional<MessageDict> kept_;   // mutex_
-  std::uint64_t keptGeneration_ = 0;  // mutex_
+  Mutex mutex_;
+  std::optional<MessageDict> kept_ GUARDED_BY(mutex_);
+  std::uint64_t keptGeneration_ GUARDED_BY(mutex_) = 0;
   std::atomic<std::uint64_t> generation_{1};
   std::uint64_t watchedEpoch_ = 0;  // I/O context
 };

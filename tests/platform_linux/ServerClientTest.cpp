@@ -9,11 +9,11 @@
 #include <cstdlib>
 #include <future>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <thread>
 
 #include "detail/ProcessBus.h"
+#include "platform/Mutex.h"
 #include "platform/ServerClient.h"
 #include "platform/ServerProtocol.h"
 #include "platform/linux/testing/BusTesting.h"
@@ -48,9 +48,9 @@ class ManagerTest : public ::testing::Test {
     manager_ = client::CreateManager("halvextool", *queue_);
   }
 
-  void add(Delivery delivery) {
+  void add(Delivery delivery) EXCLUDES(mutex_) {
     delivery.onQueue = queue_->isCurrent();
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     mail_.push_back(std::move(delivery));
     changed_.notify_all();
   }
@@ -67,13 +67,19 @@ class ManagerTest : public ::testing::Test {
 
   // The deliveries named name (any, when empty) so far.
   std::vector<Delivery> mail(const std::string& name = {}) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return mailLocked(name);
   }
   // True once at least count deliveries named name have arrived.
   bool waitFor(std::size_t count, const std::string& name = {}) {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kFailsafe, [&] { return mailLocked(name).size() >= count; });
+    const auto deadline = std::chrono::steady_clock::now() + kFailsafe;
+    MutexLock lock(mutex_);
+    while (mailLocked(name).size() < count) {
+      if (!lock.waitUntil(changed_, deadline)) {
+        return mailLocked(name).size() >= count;
+      }
+    }
+    return true;
   }
   // True once everything posted to the queue before the call has run.
   bool drain() {
@@ -106,16 +112,16 @@ class ManagerTest : public ::testing::Test {
   std::shared_ptr<Manager> manager_;
 
  private:
-  std::vector<Delivery> mailLocked(const std::string& name) const {
+  std::vector<Delivery> mailLocked(const std::string& name) const REQUIRES(mutex_) {
     std::vector<Delivery> out;
     std::copy_if(mail_.begin(), mail_.end(), std::back_inserter(out),
                  [&](const Delivery& d) { return name.empty() || d.name == name; });
     return out;
   }
 
-  std::mutex mutex_;
+  Mutex mutex_;
   std::condition_variable changed_;
-  std::vector<Delivery> mail_;
+  std::vector<Delivery> mail_ GUARDED_BY(mutex_);
 };
 
 MessageDict sampleRequest() {

@@ -25,7 +25,7 @@ void EventHub::off() {
 void EventHub::setHandler(const std::string& event, EventHandler handler) {
   // The handler replaced goes after the lock: destroying it may run anything.
   EventHandler previous;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (closed_) {
     return;
   }
@@ -35,7 +35,7 @@ void EventHub::setHandler(const std::string& event, EventHandler handler) {
 void EventHub::close() {
   off();
   std::map<std::string, EventHandler> handlers;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   closed_ = true;
   handlers.swap(handlers_);
 }
@@ -55,7 +55,7 @@ void EventHub::deliver(std::uint64_t token, const std::string& event, MessageVal
   }
   EventHandler handler;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto it = handlers_.find(event);
     if (closed_ || it == handlers_.end()) {
       return;

@@ -8,10 +8,10 @@
 #include <cstddef>
 #include <cstdint>
 #include <map>
-#include <mutex>
 #include <string>
 
 #include "detail/Private.h"
+#include "platform/Mutex.h"
 #include "platform/ServerClient.h"
 
 namespace halvex::client {
@@ -27,23 +27,24 @@ class EventHub {
   void on();
   void off();
 
-  void setHandler(const std::string& event, EventHandler handler);
+  void setHandler(const std::string& event, EventHandler handler) EXCLUDES(mutex_);
   // Off for good; the handlers go on this thread.
-  void close();
+  void close() EXCLUDES(mutex_);
 
   // Counts an event about to be queued; false, counting nothing, when too many are queued.
   bool reserve();
   // Runs on the manager's queue, for an event reserve() counted.
-  void deliver(std::uint64_t token, const std::string& event, MessageValue payload);
+  void deliver(std::uint64_t token, const std::string& event, MessageValue payload)
+      EXCLUDES(mutex_);
 
  private:
   void release() { undelivered_.fetch_sub(1); }
 
   std::atomic<std::uint64_t> state_{0};  // generation * 2 + (on ? 1 : 0)
   std::atomic<std::size_t> undelivered_{0};
-  std::mutex mutex_;
-  std::map<std::string, EventHandler> handlers_;
-  bool closed_ = false;
+  Mutex mutex_;
+  std::map<std::string, EventHandler> handlers_ GUARDED_BY(mutex_);
+  bool closed_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace halvex::client

@@ -41,18 +41,20 @@ HandOver::~HandOver() {
 }
 
 void HandOver::Turn::lock() {
-  try_lock_until(Deadline::max());
+  tryLockUntil(Deadline::max());
 }
 
-bool HandOver::Turn::try_lock() {
-  std::lock_guard lock(mutex_);
+bool HandOver::Turn::tryLock() {
+  MutexLock lock(mutex_);
   return !std::exchange(held_, true);
 }
 
-bool HandOver::Turn::try_lock_until(Deadline by) {
-  std::unique_lock lock(mutex_);
-  if (!free_.wait_until(lock, by, [this] { return !held_; })) {
-    return false;
+bool HandOver::Turn::tryLockUntil(Deadline by) {
+  MutexLock lock(mutex_);
+  while (held_) {
+    if (!lock.waitUntil(free_, by) && held_) {
+      return false;
+    }
   }
   held_ = true;
   return true;
@@ -60,7 +62,7 @@ bool HandOver::Turn::try_lock_until(Deadline by) {
 
 void HandOver::Turn::unlock() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     held_ = false;
   }
   free_.notify_one();
@@ -87,13 +89,15 @@ bool HandOver::post(Task task, Deadline by) {
     if (enqueue(task)) {
       return true;
     }
-    std::unique_lock io(ioTurn_, std::defer_lock);
-    if (!io.try_lock_until(by)) {
+    Hold io(ioTurn_, std::defer_lock);
+    if (!io.tryLockUntil(by)) {
       return false;
     }
     // A loop may have claimed the connection between the two looks; then it takes the work.
     if (!claimed_) {
-      runHere(task, io);
+      runHere(task);
+      io.unlock();
+      keeper_.flushLog();
       return true;
     }
   }
@@ -101,27 +105,25 @@ bool HandOver::post(Task task, Deadline by) {
 
 bool HandOver::runDirectly(const Task& task) {
   {
-    std::lock_guard lock(inboxMutex_);
+    MutexLock lock(inboxMutex_);
     if (inboxOpen_) {
       return false;
     }
   }
-  std::unique_lock io(ioTurn_);
+  Hold io(ioTurn_);
   if (claimed_) {
     return false;
   }
-  runHere(task, io);
+  runHere(task);
+  io.unlock();
+  keeper_.flushLog();
   return true;
 }
 
-void HandOver::runHere(const Task& task, std::unique_lock<Turn>& io) {
-  {
-    IoScope scope;
-    task();
-    keeper_.serveDirectly();
-  }
-  io.unlock();
-  keeper_.flushLog();
+void HandOver::runHere(const Task& task) {
+  IoScope scope;
+  task();
+  keeper_.serveDirectly();
 }
 
 bool HandOver::send(Task task, Deadline by) {
@@ -133,8 +135,8 @@ bool HandOver::borrow(const Task& task) {
   {
     // A loop that is awake holds the lock: the work is then queued for it rather than waiting
     // here for it to finish what it does.
-    std::unique_lock io(ioTurn_, std::try_to_lock);
-    if (!io.owns_lock() || !claimed_ || !keeper_.lendable()) {
+    Hold io(ioTurn_, std::defer_lock);
+    if (!io.tryLock() || !claimed_ || !keeper_.lendable()) {
       return false;
     }
     IoScope scope;
@@ -156,7 +158,7 @@ bool HandOver::borrow(const Task& task) {
 bool HandOver::enqueue(Task& task) {
   bool wasEmpty = false;
   {
-    std::lock_guard lock(inboxMutex_);
+    MutexLock lock(inboxMutex_);
     if (!inboxOpen_) {
       return false;
     }
@@ -176,30 +178,27 @@ void HandOver::wake() {
   [[maybe_unused]] ssize_t written = write(wakeFd_, &one, sizeof one);
 }
 
-int HandOver::claim() {
-  if (wakeFd_ < 0) {
-    return -wakeFdError_;
-  }
-  std::unique_lock io(ioTurn_);
+bool HandOver::claim() {
+  ioTurn_.lock();
   if (claimed_) {
-    return -EBUSY;
+    ioTurn_.unlock();
+    return false;
   }
   claimed_ = true;
-  loopLock_ = std::move(io);
   tIoContext = true;
-  return 0;
+  return true;
 }
 
 void HandOver::open() {
-  std::lock_guard lock(inboxMutex_);
+  MutexLock lock(inboxMutex_);
   inboxOpen_ = true;
 }
 
 int HandOver::sleep(const std::function<int()>& wait) {
-  loopLock_.unlock();
+  ioTurn_.unlock();
   keeper_.flushLog();
   const int r = wait();
-  loopLock_.lock();
+  ioTurn_.lock();
   return r;
 }
 
@@ -208,7 +207,7 @@ void HandOver::drain() {
   [[maybe_unused]] ssize_t got = read(wakeFd_, &count, sizeof count);
   std::deque<Task> batch;
   {
-    std::lock_guard lock(inboxMutex_);
+    MutexLock lock(inboxMutex_);
     batch.swap(inbox_);
   }
   for (Task& task : batch) {
@@ -220,14 +219,14 @@ void HandOver::drain() {
 }
 
 void HandOver::close() {
-  std::lock_guard lock(inboxMutex_);
+  MutexLock lock(inboxMutex_);
   inboxOpen_ = false;
 }
 
 void HandOver::release() {
   claimed_ = false;
   tIoContext = false;
-  loopLock_.unlock();
+  ioTurn_.unlock();
   keeper_.flushLog();
 }
 

@@ -20,6 +20,7 @@
 #include <mutex>
 
 #include "detail/Private.h"
+#include "platform/Mutex.h"
 
 namespace halvex::bus {
 
@@ -60,65 +61,94 @@ class HandOver {
   // Runs task in the I/O context: on the loop's thread in the order posted, or, with no loop, at
   // once on this thread, which then serves what the task sent. False, with task not run, when
   // there is no loop and another caller keeps the connection past by.
-  bool post(Task task, Deadline by = Deadline::max());
+  bool post(Task task, Deadline by = Deadline::max()) EXCLUDES(ioTurn_);
   // With no loop, runs task as post() does and is true; with a loop, false and nothing runs.
-  bool runDirectly(const Task& task);
+  bool runDirectly(const Task& task) EXCLUDES(ioTurn_);
   // As post(), but runs task on this thread when the loop sleeps and the keeper can lend the
   // connection: for sending a request without handing it to another thread.
-  bool send(Task task, Deadline by);
+  bool send(Task task, Deadline by) EXCLUDES(ioTurn_);
 
   // --- the loop's thread ---
 
   // The descriptor that becomes readable when work is queued for the loop.
   int wakeFd() const { return wakeFd_; }
-  // Makes this thread the I/O context until release(). 0, or -EBUSY when a loop has claimed it
-  // already, or the errno of the wake descriptor that could not be made. Queued work waits until
-  // open().
-  int claim();
-  void open();
+  // The errno of the wake descriptor that could not be made, or 0. Without it no loop can claim
+  // the connection.
+  int wakeFdError() const { return wakeFdError_; }
+  // Makes this thread the I/O context until release(); false when a loop has claimed it
+  // already. Queued work waits until open().
+  bool claim() TRY_ACQUIRE(true, ioTurn_);
+  void open() EXCLUDES(inboxMutex_);
   // Lets go of the I/O context while wait runs (the loop's sleep), then takes it back.
-  int sleep(const std::function<int()>& wait);
+  int sleep(const std::function<int()>& wait) REQUIRES(ioTurn_);
   // Runs what was queued, in order.
   void drain();
   // Takes no more work; what was queued still runs with drain().
-  void close();
+  void close() EXCLUDES(inboxMutex_);
   // Hands the connection back to direct use.
-  void release();
+  void release() RELEASE(ioTurn_);
   // Queues task for the loop and wakes it; false, leaving task alone, when no loop takes work.
-  bool enqueue(Task& task);
+  bool enqueue(Task& task) EXCLUDES(inboxMutex_);
 
  private:
   // The I/O context as a lock whose waiters can give up at a deadline. (A timed mutex would do,
   // but ThreadSanitizer cannot follow pthread_mutex_clocklock.)
-  class Turn {
+  class CAPABILITY("I/O context") Turn {
    public:
-    void lock();
-    bool try_lock();
-    bool try_lock_until(Deadline by);
-    void unlock();
+    void lock() ACQUIRE();
+    bool tryLock() TRY_ACQUIRE(true);
+    bool tryLockUntil(Deadline by) TRY_ACQUIRE(true);
+    void unlock() RELEASE();
 
    private:
-    std::mutex mutex_;
+    Mutex mutex_;
     std::condition_variable free_;
-    bool held_ = false;
+    bool held_ GUARDED_BY(mutex_) = false;
   };
 
-  bool borrow(const Task& task);
+  // A caller's turn, let go of at the end of its scope at the latest: taken at once, or tried.
+  class SCOPED_CAPABILITY Hold {
+   public:
+    explicit Hold(Turn& turn) ACQUIRE(turn) : turn_(turn) { turn.lock(); }
+    Hold(Turn& turn, std::defer_lock_t) EXCLUDES(turn) : turn_(turn), held_(false) {}
+    ~Hold() RELEASE() {
+      if (held_) {
+        turn_.unlock();
+      }
+    }
+    Hold(const Hold&) = delete;
+    Hold& operator=(const Hold&) = delete;
+
+    bool tryLock() TRY_ACQUIRE(true) { return held_ = turn_.tryLock(); }
+    bool tryLockUntil(Deadline by) TRY_ACQUIRE(true) { return held_ = turn_.tryLockUntil(by); }
+    void unlock() RELEASE() {
+      held_ = false;
+      turn_.unlock();
+    }
+
+   private:
+    Turn& turn_;
+    bool held_ = true;
+  };
+
+  bool borrow(const Task& task) EXCLUDES(ioTurn_);
   void wake();
 
-  void runHere(const Task& task, std::unique_lock<Turn>& io);
+  // Runs task in the I/O context with no loop, then serves what it sent.
+  void runHere(const Task& task) REQUIRES(ioTurn_);
 
   Keeper& keeper_;
   const int wakeFd_;
   const int wakeFdError_;
 
+  // Held by the thread that is the I/O context: the loop's, from claim() to release() but for
+  // its sleeps, or a caller's, with no loop or borrowing the sleeping loop's connection.
   Turn ioTurn_;
-  std::unique_lock<Turn> loopLock_{ioTurn_, std::defer_lock};  // the loop's hold
-  bool claimed_ = false;                                       // ioTurn_
+  bool claimed_ GUARDED_BY(ioTurn_) = false;
 
-  std::mutex inboxMutex_;
-  std::deque<Task> inbox_;
-  bool inboxOpen_ = false;  // inboxMutex_
+  Mutex inboxMutex_;
+  std::deque<Task> inbox_ GUARDED_BY(inboxMutex_);
+  bool inboxOpen_ GUARDED_BY(inboxMutex_) = false;
 };
 
 }  // namespace halvex::bus

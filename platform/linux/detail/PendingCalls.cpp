@@ -37,7 +37,7 @@ std::string LoggedOutcome::describe() const {
 LogOutbox::LogOutbox(std::shared_ptr<LogServer> server) : server_(std::move(server)) {}
 
 void LogOutbox::add(LoggedOutcome entry) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   entries_.push_back(std::move(entry));
   waiting_.store(true, std::memory_order_release);
 }
@@ -46,10 +46,10 @@ void LogOutbox::flush() {
   if (!waiting_.load(std::memory_order_acquire)) {
     return;
   }
-  std::lock_guard writer(writing_);
+  MutexLock writer(writing_);
   {
     // Swapped with the batch emptied last time, so that neither side allocates anew.
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     batch_.swap(entries_);
     waiting_.store(false, std::memory_order_relaxed);
   }

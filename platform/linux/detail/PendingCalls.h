@@ -17,11 +17,11 @@
 #include <functional>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "detail/Private.h"
+#include "platform/Mutex.h"
 #include "platform/Result.h"
 #include "platform/SystemLog.h"
 
@@ -44,17 +44,17 @@ class LogOutbox {
  public:
   explicit LogOutbox(std::shared_ptr<LogServer> server);
 
-  void add(LoggedOutcome entry);
+  void add(LoggedOutcome entry) EXCLUDES(mutex_);
   // Writes whatever waits: failures at warning priority, successes at debug.
-  void flush();
+  void flush() EXCLUDES(writing_, mutex_);
 
  private:
   const std::shared_ptr<LogServer> server_;
   std::atomic<bool> waiting_{false};  // a cheap look before the locks
-  std::mutex writing_;                // one writer at a time, so entries never pass each other
-  std::vector<LoggedOutcome> batch_;  // writing_
-  std::mutex mutex_;                  // entries_
-  std::vector<LoggedOutcome> entries_;
+  Mutex writing_;                     // one writer at a time, so entries never pass each other
+  std::vector<LoggedOutcome> batch_ GUARDED_BY(writing_);
+  Mutex mutex_;
+  std::vector<LoggedOutcome> entries_ GUARDED_BY(mutex_);
 };
 
 class PendingCalls {

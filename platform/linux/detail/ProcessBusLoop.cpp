@@ -19,11 +19,13 @@ constexpr std::uint64_t kExpiryAccuracyUsec = 1000;
 }  // namespace
 
 int ProcessBus::run(const std::function<void()>& claimed) {
-  int r = handOver_.claim();
-  if (r < 0) {
-    return r;
+  if (handOver_.wakeFdError() != 0) {
+    return -handOver_.wakeFdError();
   }
-  r = setUpLoop();
+  if (!handOver_.claim()) {
+    return -EBUSY;
+  }
+  int r = setUpLoop();
   if (r < 0) {
     tearDownLoop();
     handOver_.release();

@@ -214,6 +214,7 @@ TEST(ScreenTest, DrawsTheVisiblePartAroundTheCursor) {
   } cases[] = {
       {"> ", "abc", 3, 80, "\r> abc\x1b[K\r\x1b[5C"},
       {"", "", 0, 80, "\r\x1b[K\r"},
+      {"", "x", 1, 80, "\rx\x1b[K\r\x1b[1C"},
       {"> ", "abcdefghij", 10, 8, "\r> ghij\x1b[K\r\x1b[6C"},
       {"> ", "abcdefghij", 0, 8, "\r> abcde\x1b[K\r\x1b[2C"},
       {"> ", "abcdefghij", 5, 8, "\r> bcdef\x1b[K\r\x1b[6C"},

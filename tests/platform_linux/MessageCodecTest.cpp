@@ -59,6 +59,7 @@ TEST(CodecTest, ValuesSurviveTheTripWithTheirKeyOrder) {
       MessageValue::null(),
       MessageValue::string(""),
       MessageValue::string("Grüße \u2603 \U0001F600"),
+      MessageValue::string("\u0080\u0800\U00010000"),  // the least of each length
       MessageValue::int64(INT64_MIN),
       MessageValue::int64(INT64_MAX),
       MessageValue::boolean(true),

@@ -157,7 +157,9 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
             R"({"key":"mike","type":"int64","value":-42},)"
             R"({"key":"nested","type":"dict","value":[{"key":"b","type":"null","value":null},)"
             R"({"key":"a","type":"string","value":"inner"}]}])");
-  EXPECT_EQ(client::PerformCommand(manager_, "Refused", {}, reply).code, 7);
+  const Result refused = client::PerformCommand(manager_, "Refused", {}, reply);
+  EXPECT_EQ(refused.code, 7);
+  EXPECT_EQ(refused.message, "simulated failure");
   EXPECT_EQ(reply, MessageValue::string("kept"));
   for (const std::string& command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')}) {
     EXPECT_EQ(client::PerformCommand(manager_, command, {}, reply).code, kResultInvalidRequest);

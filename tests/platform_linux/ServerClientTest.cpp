@@ -12,6 +12,7 @@
 #include <optional>
 #include <thread>
 
+#include "detail/BusSupport.h"
 #include "detail/ProcessBus.h"
 #include "platform/Mutex.h"
 #include "platform/ServerClient.h"
@@ -161,13 +162,16 @@ TEST_F(ManagerTest, RequestsCompleteOnceWithTheirOutcome) {
   EXPECT_EQ(refused.code, 7);
   EXPECT_EQ(refused.message, "simulated failure");
   EXPECT_EQ(reply, MessageValue::string("kept"));
-  for (const std::string& command : {"Bad\xff"s, "Nul\0"s, ""s, std::string(300, 'c')}) {
+  for (const std::string& command :
+       {"Bad\xff"s, "Nul\0"s, ""s, std::string(bus::kMaxNameLength + 1, 'c')}) {
     EXPECT_EQ(client::PerformCommand(manager_, command, {}, reply).code, kResultInvalidRequest);
   }
   MessageDict badKey;
   badKey.set("\xff", MessageValue::null());
   EXPECT_EQ(client::PerformCommand(manager_, "Fine", badKey, reply).code, kResultInvalidRequest);
   EXPECT_EQ(sim_->requestLog().size(), 2u);
+  const std::string longest(bus::kMaxNameLength, 'c');
+  EXPECT_NE(client::PerformCommand(manager_, longest, {}, reply).code, kResultInvalidRequest);
   EXPECT_EQ(client::PerformCommand(manager_, "Hang", {}, reply).code, kResultTimeout);
 
   client::PerformCommand(manager_, kCommandTraceDumpState, record("async"), {});

@@ -224,7 +224,8 @@ TEST(ScreenTest, DrawsTheVisiblePartAroundTheCursor) {
       // The first surrogate, and the last character past Unicode's end: no characters.
       {"", "\xed\xa0\x80", 3, 80, "\r" + kMark + kMark + kMark + "\x1b[K\r\x1b[3C"},
       {"", "\xf4\x90\x80\x80", 4, 80, "\r" + kMark + kMark + kMark + kMark + "\x1b[K\r\x1b[4C"},
-      {"", "\xea\xb0\x80x", 4, 80, "\r\xea\xb0\x80x\x1b[K\r\x1b[3C"},  // a wide range's first
+      // The first and the last character of a wide range.
+      {"", "\xea\xb0\x80\xed\x9e\xa3x", 7, 80, "\r\xea\xb0\x80\xed\x9e\xa3x\x1b[K\r\x1b[5C"},
       {"", "\xef\xbc\xa1\xf0\x9f\x98\x80x", 8, 80,
        "\r\xef\xbc\xa1\xf0\x9f\x98\x80x\x1b[K\r\x1b[5C"},
       {"0123456789abcdef>> ", "x", 1, 20, "\rabcdef>> x\x1b[K\r\x1b[10C"},

@@ -1,11 +1,16 @@
 // SPDX-License-Identifier: MIT
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
+#include <filesystem>
 #include <string>
 #include <vector>
 
 #include "TestTree.h"
 #include "shell/CommandShell.h"
+#include "shell/Console.h"
+#include "tests/support/FreshProcess.h"
 
 namespace halvex::testing {
 namespace {
@@ -128,6 +133,28 @@ TEST(CommandShellTest, EvaluatesCommandsExactlyAsDocumented) {
 TEST(CommandShellTest, MissingRootEndsTheRunSilently) {
   EXPECT_FALSE(runShell(nullptr, {"t"}, "help\nquit\n").ok);
   EXPECT_EQ(runShell(nullptr, {"t", "help"}).out, "");
+}
+
+// A process started without its standard descriptors gets /dev/null in their place, so that
+// nothing it opens later takes their numbers. Seen in a process of its own, which can close them.
+TEST(ConsoleTest, ReservesTheStandardDescriptorsStartedWithout) {
+  test::inFreshProcess([] {
+    const int saved = ::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 3);  // to report failures
+    ASSERT_GE(saved, 3);
+    for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd) {
+      ::close(fd);
+    }
+    reserveStandardDescriptors();
+    std::string seen[3];
+    for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd) {
+      std::error_code error;
+      seen[fd] = std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(fd), error);
+    }
+    ::dup2(saved, STDERR_FILENO);
+    for (const std::string& target : seen) {
+      EXPECT_EQ(target, "/dev/null");
+    }
+  });
 }
 
 }  // namespace

@@ -112,9 +112,8 @@ class ProcessBus final : private HandOver::Keeper {
   // --- I/O context only ---
 
   // The open connection, opening a new one when there is none or the old one broke (listeners
-  // hear of both). Null when no bus can be reached; lastOpenFailure() says why.
+  // hear of both). Null when no bus can be reached.
   sd_bus* connection();
-  const Result& lastOpenFailure() const { return lastOpenFailure_; }
 
   // Counts connections opened, so that a late answer can tell whether it belongs to the current.
   std::uint64_t epoch() const { return epoch_; }

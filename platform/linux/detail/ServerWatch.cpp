@@ -203,17 +203,13 @@ void ServerWatch::queryOwner() {
 
 // owner is the unique name now owning the server's name, empty when nobody does.
 void ServerWatch::ownerSeen(const std::string& owner) {
-  if (owner == owner_) {
-    if (!owner_.empty() && subscribeWanted_ && hub_->token() != 0) {
-      subscribe();
-    }
-    return;
+  // A new owner is subscribed to at once; the same one again only when a subscription is owed.
+  const bool changed = owner != owner_;
+  if (changed) {
+    forgetOwner();
+    owner_ = owner;
   }
-  if (!owner_.empty()) {
-    postStopped();
-  }
-  owner_ = owner;
-  if (!owner_.empty() && hub_->token() != 0) {
+  if (!owner_.empty() && (changed || subscribeWanted_) && hub_->token() != 0) {
     subscribe();
   }
 }

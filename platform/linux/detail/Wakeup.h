@@ -2,6 +2,8 @@
 // A one-shot signal between two threads: one waits, the other sets it once. The waiter sleeps in
 // the kernel until then, without spinning, and a signal set before the wait costs no system call
 // on either side. Either side may go first; the object must outlive both calls.
+// Not std::atomic::wait: libstdc++ spins and yields the processor before it sleeps, which is
+// the busy hand-off this replaces.
 #pragma once
 
 #include <atomic>

@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <string>
+#include <system_error>
 
 #include "platform/ServerProtocol.h"
 #include "platform/linux/MessageCodec.h"
@@ -105,9 +106,14 @@ int ControlObject::onSetIdentity(sd_bus_message* call, void* userdata, sd_bus_er
       return self->endpoint_.refuse(error, asked, SD_BUS_ERROR_INVALID_ARGS,
                                     "a key or a type that GetIdentity does not answer with");
     }
-    if (r < 0) {
+    if (r == -ENOTCONN) {
       return self->endpoint_.refuse(error, asked, kErrorDeviceAbsent,
                                     "the device is not on the bus");
+    }
+    if (r < 0) {
+      const std::string reason =
+          "IdentityChanged cannot be sent: " + std::generic_category().message(-r);
+      return self->endpoint_.refuse(error, asked, SD_BUS_ERROR_FAILED, reason.c_str());
     }
     self->endpoint_.journal().log(LogLevel::kInfo, asked + ": IdentityChanged sent");
     return sd_bus_reply_method_return(call, "");

@@ -84,9 +84,13 @@ int DeviceObject::change(const MessageDict& changes) {
       return -EINVAL;
     }
   }
-  identity_ = changed;
-  return sd_bus_emit_signal(endpoint_.bus(), bus::kDevicePath, bus::kDeviceInterface,
-                            bus::kDeviceIdentityChanged, "");
+  // Kept only once the signal is on its way: the GetIdentity that follows is answered after.
+  const int r = sd_bus_emit_signal(endpoint_.bus(), bus::kDevicePath, bus::kDeviceInterface,
+                                   bus::kDeviceIdentityChanged, "");
+  if (r >= 0) {
+    identity_ = changed;
+  }
+  return r;
 }
 
 int DeviceObject::onGetIdentity(sd_bus_message* call, void* userdata, sd_bus_error* error) {

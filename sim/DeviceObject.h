@@ -23,7 +23,7 @@ class DeviceObject {
 
   // Takes the values changes names, with the keys and types GetIdentity answers with, and sends
   // IdentityChanged. Returns a negative errno, changing nothing: -EINVAL for another key or type,
-  // -ENOTCONN while the service is not on the bus.
+  // -ENOTCONN while the service is not on the bus, another when the signal cannot be sent.
   int change(const MessageDict& changes);
 
  private:

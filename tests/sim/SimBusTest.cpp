@@ -72,6 +72,8 @@ TEST(SimBus, AnswersAsTheScenarioSays) {
        "Call failed: a key or a type that GetIdentity does not answer with"},
       {"{}", "Simulator SetIdentity a{sv} 1 RadioType b true",
        "Call failed: a key or a type that GetIdentity does not answer with"},
+      {"{}", "Simulator SetIdentity a{sv} 1 RadioType d 1.5",
+       "Call failed: the identity holds a value outside the message types"},
       {"{}", "Simulator SetIdentity a{sv} 2 RadioType x 9 InternalBuild b false", ""},
       {"{}", "Device GetIdentity",
        R"(a{sv} 7 "RadioType" x 9 "RadioVendor" x 2 "ProductType" x 0 "InternalBuild" b false )"
